@@ -1,0 +1,3 @@
+// Placeholder; filled in by the emulation.
+#pragma once
+#include "platform/posix/win32_base.h"
