@@ -325,3 +325,9 @@ BOOL GetVersionExW(LPOSVERSIONINFOW info);
 DWORD GetModuleFileNameW(HMODULE module, LPWSTR fileName, DWORD size);
 LPWSTR GetCommandLineW();
 LPWSTR* CommandLineToArgvW(LPCWSTR commandLine, int* argumentCount);
+
+// ---- Added by the emulation core (not in the first cut of this header) ------
+constexpr DWORD ERROR_SEM_TIMEOUT = 121;
+constexpr DWORD ERROR_UNKNOWN_REVISION = 1305;
+constexpr DWORD ERROR_MAPPED_ALIGNMENT = 1132;
+constexpr DWORD ERROR_NOT_ENOUGH_QUOTA = 1816;

@@ -1,0 +1,151 @@
+// Objects shared between processes of one emulation namespace. The other
+// process is a fork() of the test program that runs a few Win32 calls and
+// leaves with _exit (no gtest in the child).
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstring>
+
+#include "platform/diagnostics.h"
+#include "platform/win32.h"
+
+namespace {
+
+// Runs `body` in a child process; returns its pid. The child's exit code is
+// the body's result.
+template <class Body>
+pid_t Fork(Body body) {
+  pid_t pid = fork();
+  if (pid == 0) _exit(body());
+  return pid;
+}
+
+int ExitCodeOf(pid_t pid) {
+  int status = 0;
+  if (waitpid(pid, &status, 0) != pid) return -1;
+  return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+}
+
+TEST(CrossProcess, NamedEventSetByChildReleasesWaiter) {
+  HANDLE ready = CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuXpReady"));
+  ASSERT_NE(ready, nullptr);
+  pid_t child = Fork([] {
+    // The child inherits no handles: it opens the event by name.
+    HANDLE event = OpenEventW(EVENT_MODIFY_STATE, FALSE, WSTR("Global\\EmuXpReady"));
+    if (event == nullptr) return 10;
+    if (platform::LiveHandleCount() != 1) return 11;
+    if (!SetEvent(event)) return 12;
+    return CloseHandle(event) ? 0 : 13;
+  });
+  EXPECT_EQ(WaitForSingleObject(ready, 10000), WAIT_OBJECT_0);
+  EXPECT_EQ(ExitCodeOf(child), 0);
+  // The child's handle went with it; the parent's still works.
+  EXPECT_TRUE(ResetEvent(ready));
+  EXPECT_EQ(WaitForSingleObject(ready, 0), WAIT_TIMEOUT);
+  CloseHandle(ready);
+}
+
+TEST(CrossProcess, MutexOfKilledProcessIsAbandoned) {
+  HANDLE owned = CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuXpOwned"));
+  HANDLE mutex = CreateMutexW(nullptr, FALSE, WSTR("Global\\EmuXpMutex"));
+  ASSERT_NE(mutex, nullptr);
+  pid_t child = Fork([] {
+    HANDLE m = OpenMutexW(MUTEX_ALL_ACCESS, FALSE, WSTR("Global\\EmuXpMutex"));
+    HANDLE o = OpenEventW(EVENT_ALL_ACCESS, FALSE, WSTR("Global\\EmuXpOwned"));
+    if (m == nullptr || o == nullptr) return 10;
+    if (WaitForSingleObject(m, 0) != WAIT_OBJECT_0) return 11;
+    SetEvent(o);
+    for (;;) pause();  // killed while it owns the mutex
+  });
+  ASSERT_EQ(WaitForSingleObject(owned, 10000), WAIT_OBJECT_0);
+  EXPECT_EQ(WaitForSingleObject(mutex, 0), WAIT_TIMEOUT);
+  kill(child, SIGKILL);
+  EXPECT_EQ(ExitCodeOf(child), 128 + SIGKILL);
+  HANDLE pair[2] = {owned, mutex};
+  ResetEvent(owned);
+  EXPECT_EQ(WaitForMultipleObjects(2, pair, FALSE, 10000), WAIT_ABANDONED_0 + 1);
+  EXPECT_TRUE(ReleaseMutex(mutex));
+  EXPECT_EQ(WaitForSingleObject(mutex, 0), WAIT_OBJECT_0);
+  EXPECT_TRUE(ReleaseMutex(mutex));
+  CloseHandle(mutex);
+  CloseHandle(owned);
+}
+
+TEST(CrossProcess, MappingContentAndLifetime) {
+  constexpr DWORD kSize = 1215512;
+  HANDLE mapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0, kSize,
+                                      WSTR("Global\\EmuXpMap"));
+  ASSERT_NE(mapping, nullptr);
+  EXPECT_EQ(GetLastError(), ERROR_SUCCESS);
+  auto* view = static_cast<unsigned char*>(MapViewOfFile(mapping, FILE_MAP_ALL_ACCESS, 0, 0, 0));
+  ASSERT_NE(view, nullptr);
+  EXPECT_EQ(view[0], 0);
+  EXPECT_EQ(view[kSize - 1], 0);
+  std::memcpy(view + kSize - 5, "abcd", 4);
+
+  pid_t child = Fork([] {
+    HANDLE again = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0, 4096,
+                                      WSTR("Global\\EmuXpMap"));
+    if (again == nullptr || GetLastError() != ERROR_ALREADY_EXISTS) return 10;
+    auto* v = static_cast<unsigned char*>(MapViewOfFile(again, FILE_MAP_ALL_ACCESS, 0, 0, 0));
+    if (v == nullptr) return 11;
+    if (std::memcmp(v + kSize - 5, "abcd", 4) != 0) return 12;
+    v[0] = 0x5A;
+    // Closing the handle first: the view keeps the mapping alive.
+    CloseHandle(again);
+    v[1] = 0xA5;
+    return UnmapViewOfFile(v) ? 0 : 13;
+  });
+  EXPECT_EQ(ExitCodeOf(child), 0);
+  EXPECT_EQ(view[0], 0x5A);
+  EXPECT_EQ(view[1], 0xA5);
+
+  // A view of part of it, at an allocation-granularity offset.
+  auto* part = static_cast<unsigned char*>(MapViewOfFile(mapping, FILE_MAP_READ, 0, 65536, 16));
+  ASSERT_NE(part, nullptr);
+  view[65536] = 7;
+  EXPECT_EQ(part[0], 7);
+  EXPECT_EQ(MapViewOfFile(mapping, FILE_MAP_READ, 0, 100, 16), nullptr);
+  EXPECT_EQ(GetLastError(), ERROR_MAPPED_ALIGNMENT);
+  EXPECT_TRUE(UnmapViewOfFile(part));
+  EXPECT_FALSE(UnmapViewOfFile(part));
+  EXPECT_EQ(GetLastError(), ERROR_INVALID_ADDRESS);
+
+  // A handle opened for reading gives read views only.
+  HANDLE reader = OpenFileMappingW(FILE_MAP_READ, FALSE, WSTR("Global\\EmuXpMap"));
+  ASSERT_NE(reader, nullptr);
+  EXPECT_EQ(MapViewOfFile(reader, FILE_MAP_WRITE, 0, 0, 0), nullptr);
+  EXPECT_EQ(GetLastError(), ERROR_ACCESS_DENIED);
+  auto* readView = static_cast<unsigned char*>(MapViewOfFile(reader, FILE_MAP_READ, 0, 0, 0));
+  ASSERT_NE(readView, nullptr);
+  EXPECT_EQ(readView[1], 0xA5);
+  EXPECT_TRUE(UnmapViewOfFile(readView));
+  CloseHandle(reader);
+
+  // The handle goes, the view keeps the object: it is still found by name.
+  EXPECT_TRUE(CloseHandle(mapping));
+  HANDLE reopened = OpenFileMappingW(FILE_MAP_READ, FALSE, WSTR("Global\\EmuXpMap"));
+  ASSERT_NE(reopened, nullptr);
+  CloseHandle(reopened);
+  EXPECT_TRUE(UnmapViewOfFile(view));
+  EXPECT_EQ(OpenFileMappingW(FILE_MAP_READ, FALSE, WSTR("Global\\EmuXpMap")), nullptr);
+  EXPECT_EQ(GetLastError(), ERROR_FILE_NOT_FOUND);
+}
+
+TEST(CrossProcess, ObjectsOfDeadProcessesAreFreed) {
+  pid_t child = Fork([] {
+    HANDLE e = CreateEventW(nullptr, TRUE, TRUE, WSTR("Global\\EmuXpLeaked"));
+    return e != nullptr ? 0 : 10;  // exits without closing
+  });
+  ASSERT_EQ(ExitCodeOf(child), 0);
+  SetLastError(0);
+  HANDLE fresh = CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuXpLeaked"));
+  ASSERT_NE(fresh, nullptr);
+  EXPECT_EQ(GetLastError(), ERROR_SUCCESS);  // a new object, not the dead one's
+  EXPECT_EQ(WaitForSingleObject(fresh, 0), WAIT_TIMEOUT);
+  CloseHandle(fresh);
+}
+
+}  // namespace
