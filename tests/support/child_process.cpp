@@ -1,0 +1,188 @@
+#include "child_process.h"
+
+#include <cstdlib>
+#include <string>
+#include <vector>
+
+#include "test_support.h"
+
+#if !defined(_WIN32)
+#include <errno.h>
+#include <poll.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <thread>
+
+extern char** environ;
+#endif
+
+namespace skytest {
+
+const char* ChildRole() {
+  const char* role = std::getenv(kChildRoleVariable);
+  return (role != nullptr && *role != '\0') ? role : nullptr;
+}
+
+namespace {
+
+std::string FilterArgument() {
+  return "--gtest_filter=" + CurrentTestName();
+}
+
+bool IsOwnVariable(const std::string& entry) {
+  for (const char* name : {kChildRoleVariable, kOwnerPidVariable}) {
+    std::string prefix = std::string(name) + "=";
+    if (entry.compare(0, prefix.size(), prefix) == 0) return true;
+  }
+  return false;
+}
+
+}  // namespace
+
+#if defined(_WIN32)
+
+bool ChildProcess::Start(const char* role) {
+  if (Running()) return false;
+  WCHAR path[MAX_PATH];
+  DWORD length = GetModuleFileNameW(nullptr, path, MAX_PATH);
+  if (length == 0 || length >= MAX_PATH) return false;
+
+  WideString commandLine = WSTR("\"");
+  commandLine += path;
+  commandLine += WSTR("\" ");
+  commandLine += Utf8ToWide(FilterArgument());
+
+  // The parent's environment without our own variables, then the child's.
+  std::vector<WCHAR> block;
+  if (LPWCH current = GetEnvironmentStringsW()) {
+    for (LPWCH entry = current; *entry != 0; entry += WideLength(entry) + 1) {
+      if (IsOwnVariable(WideToUtf8(entry))) continue;
+      block.insert(block.end(), entry, entry + WideLength(entry) + 1);
+    }
+    FreeEnvironmentStringsW(current);
+  }
+  for (const std::string& extra :
+       {std::string(kChildRoleVariable) + "=" + role,
+        std::string(kOwnerPidVariable) + "=" + std::to_string(OwnerProcessId())}) {
+    WideString wide = Utf8ToWide(extra);
+    block.insert(block.end(), wide.begin(), wide.end());
+    block.push_back(0);
+  }
+  block.push_back(0);
+
+  STARTUPINFOW startup{};
+  startup.cb = sizeof(startup);
+  PROCESS_INFORMATION info{};
+  if (!CreateProcessW(path, commandLine.data(), nullptr, nullptr, FALSE, CREATE_UNICODE_ENVIRONMENT,
+                      block.data(), nullptr, &startup, &info)) {
+    return false;
+  }
+  CloseHandle(info.hThread);
+  id_ = reinterpret_cast<std::intptr_t>(info.hProcess);
+  return true;
+}
+
+int ChildProcess::Wait(DWORD timeoutMs) {
+  if (!Running()) return -2;
+  HANDLE process = reinterpret_cast<HANDLE>(id_);
+  int result = -1;
+  if (WaitForSingleObject(process, timeoutMs) == WAIT_OBJECT_0) {
+    DWORD code = 0;
+    if (GetExitCodeProcess(process, &code)) result = static_cast<int>(code);
+  } else {
+    TerminateProcess(process, 255);
+    WaitForSingleObject(process, kProcessGuardMs);
+  }
+  CloseHandle(process);
+  id_ = 0;
+  return result;
+}
+
+ChildProcess::~ChildProcess() {
+  if (Running()) Wait(0);
+}
+
+#else
+
+bool ChildProcess::Start(const char* role) {
+  if (Running()) return false;
+  std::string filter = FilterArgument();
+  std::string self = "/proc/self/exe";
+  std::vector<char*> argv = {self.data(), filter.data(), nullptr};
+
+  std::vector<std::string> variables;
+  for (char** entry = environ; *entry != nullptr; ++entry) {
+    if (!IsOwnVariable(*entry)) variables.emplace_back(*entry);
+  }
+  variables.push_back(std::string(kChildRoleVariable) + "=" + role);
+  variables.push_back(std::string(kOwnerPidVariable) + "=" + std::to_string(OwnerProcessId()));
+  std::vector<char*> envp;
+  for (std::string& variable : variables) envp.push_back(variable.data());
+  envp.push_back(nullptr);
+
+  pid_t pid = 0;
+  if (posix_spawn(&pid, self.c_str(), nullptr, nullptr, argv.data(), envp.data()) != 0) {
+    return false;
+  }
+  id_ = pid;
+  return true;
+}
+
+int ChildProcess::Wait(DWORD timeoutMs) {
+  if (!Running()) return -2;
+  pid_t pid = static_cast<pid_t>(id_);
+  id_ = 0;
+  int status = 0;
+  bool ended = false;
+  // A pidfd becomes readable when the child ends, which gives a proper
+  // bounded wait; without one, fall back to polling waitpid.
+  long pidfd = syscall(SYS_pidfd_open, pid, 0);
+  if (pidfd >= 0) {
+    pollfd entry{static_cast<int>(pidfd), POLLIN, 0};
+    int timeout = timeoutMs == INFINITE ? -1 : static_cast<int>(timeoutMs);
+    int ready = 0;
+    do {
+      ready = poll(&entry, 1, timeout);
+    } while (ready < 0 && errno == EINTR);
+    close(static_cast<int>(pidfd));
+    ended = ready > 0 && waitpid(pid, &status, 0) == pid;
+  } else {
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
+    for (;;) {
+      pid_t done = waitpid(pid, &status, WNOHANG);
+      if (done == pid) {
+        ended = true;
+        break;
+      }
+      if (done < 0 || std::chrono::steady_clock::now() >= deadline) break;
+      std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    }
+  }
+  if (!ended) {
+    kill(pid, SIGKILL);
+    waitpid(pid, &status, 0);
+    return -1;
+  }
+  if (WIFEXITED(status)) return WEXITSTATUS(status);
+  if (WIFSIGNALED(status)) return 128 + WTERMSIG(status);
+  return -1;
+}
+
+ChildProcess::~ChildProcess() {
+  if (Running()) Wait(0);
+}
+
+#endif
+
+int RunChildSelf(const char* role, DWORD timeoutMs) {
+  ChildProcess child;
+  if (!child.Start(role)) return -2;
+  return child.Wait(timeoutMs);
+}
+
+}  // namespace skytest

@@ -1,0 +1,78 @@
+// Small helpers shared by the test programs of both platforms: a handle that
+// closes itself, Wine detection for marking known Wine gaps, and object names
+// that are unique per test process and case.
+#pragma once
+
+#include <gtest/gtest.h>
+
+#include <string>
+
+#include "platform/wide.h"
+#include "platform/win32.h"
+
+namespace skytest {
+
+// Failure guard for Win32 waits in tests: long enough never to fire on a
+// loaded machine, short enough that a hang ends the case instead of the run.
+// The emulation scales wait time-outs by SKYVANE_TIME_SCALE, so the value is
+// divided by that factor to keep the real bound at about ten seconds.
+DWORD ScaledGuardMs();
+inline const DWORD kGuardMs = ScaledGuardMs();
+// Failure guard for waiting on a child process (real time, never scaled).
+constexpr DWORD kProcessGuardMs = 30000;
+
+// Owns one handle and closes it when it goes out of scope. Null and
+// INVALID_HANDLE_VALUE both count as "no handle".
+class Handle {
+ public:
+  Handle() = default;
+  explicit Handle(HANDLE handle) : handle_(handle) {}
+  Handle(const Handle&) = delete;
+  Handle& operator=(const Handle&) = delete;
+  Handle(Handle&& other) noexcept : handle_(other.Release()) {}
+  Handle& operator=(Handle&& other) noexcept {
+    if (this != &other) Reset(other.Release());
+    return *this;
+  }
+  ~Handle() { Reset(); }
+
+  HANDLE Get() const { return handle_; }
+  bool Valid() const { return handle_ != nullptr && handle_ != INVALID_HANDLE_VALUE; }
+  explicit operator bool() const { return Valid(); }
+  HANDLE Release() {
+    HANDLE handle = handle_;
+    handle_ = nullptr;
+    return handle;
+  }
+  void Reset(HANDLE handle = nullptr) {
+    if (Valid()) CloseHandle(handle_);
+    handle_ = handle;
+  }
+
+ private:
+  HANDLE handle_ = nullptr;
+};
+
+// True when the Windows build runs under Wine (never on the host build).
+bool IsWine();
+
+// Process id that names this case's objects: the parent's id inside a child
+// started by RunChildSelf, so that parent and child agree on the names.
+DWORD OwnerProcessId();
+
+// "<prefix>SkyvaneTest-<owner pid>-<Suite>.<Case>-<tag>": unique per test
+// process and case, so cases may run in parallel (Wine shares named objects
+// across the whole prefix) and a child finds its parent's objects.
+WideString UniqueName(const char* prefix, const char* tag);
+// The same without the prefix, as narrow text (for registry key paths).
+std::string UniqueStem(const char* tag);
+
+// Name of the running case, "Suite.Case".
+std::string CurrentTestName();
+
+}  // namespace skytest
+
+// Marks a case that Wine itself gets wrong: it is skipped under Wine with the
+// reason and still runs against the emulation (and on Windows proper).
+#define SKIP_ON_WINE(reason) \
+  if (::skytest::IsWine()) GTEST_SKIP() << "known Wine gap: " << (reason)
