@@ -19,7 +19,9 @@
 #include <ntddscsi.h>
 #include <setupapi.h>
 #include <cfgmgr32.h>
-#include <hidsdi.h>
+extern "C" {
+#include <hidsdi.h>  // declared without C linkage by mingw-w64
+}
 #include <dbt.h>
 #include <shellapi.h>
 // clang-format on

@@ -1,0 +1,17 @@
+#include "service/process_locks.h"
+
+CRITICAL_SECTION passThroughLock;
+CRITICAL_SECTION workerStopLock;
+CRITICAL_SECTION rescanLock;
+CRITICAL_SECTION serviceStatusLock;
+
+void InitializeProcessLocks() {
+  static const bool initialized = [] {
+    InitializeCriticalSection(&passThroughLock);
+    InitializeCriticalSection(&workerStopLock);
+    InitializeCriticalSection(&rescanLock);
+    InitializeCriticalSection(&serviceStatusLock);
+    return true;
+  }();
+  (void)initialized;
+}

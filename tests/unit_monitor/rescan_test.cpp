@@ -1,0 +1,90 @@
+#include "monitor/rescan.h"
+
+#include "monitor/channel_workers.h"
+#include "monitor_fixture.h"
+
+namespace {
+
+class Rescan : public MonitorFixture {
+ protected:
+  void SetUp() override {
+    MonitorFixture::SetUp();
+    ResetWorkerState();
+    StateBlock* block = monitorState.stateBlock;
+    // What an earlier enumeration and scan would have left behind.
+    block->driveCount = 2;
+    block->drives[0].gaugePercent = 40;
+    block->drives[1].gaugePercent = 75;
+    block->drives[2].gaugePercent = 9;  // beyond driveCount
+    block->channelCount = 1;
+    block->channels[0].kind = kChannelKindHid;
+    block->channels[0].linkedDrive = 0;
+    block->channels[0].gaugePercentSent = 40;
+    block->statusWord = 101;
+  }
+};
+
+TEST_F(Rescan, SuspendForgetsGaugesAndStopsWorkersWithoutRescanning) {
+  HandleForwardedMessage(0x218, 4, 0, nullptr);
+  StateBlock* block = monitorState.stateBlock;
+  EXPECT_EQ(block->drives[0].gaugePercent, 0u);
+  EXPECT_EQ(block->drives[1].gaugePercent, 0u);
+  EXPECT_EQ(block->drives[2].gaugePercent, 9u) << "only records below driveCount are touched";
+  EXPECT_EQ(block->statusWord, 102u) << "stopping the workers sets 102";
+  EXPECT_EQ(monitorState.publishNeeded, 1u);
+  EXPECT_EQ(monitorState.rescanCount, 0u);
+  EXPECT_EQ(block->channelCount, 1) << "the channel table is kept until the next rescan";
+}
+
+TEST_F(Rescan, ResumeRebuildsEverything) {
+  for (ULONG_PTR resume : {ULONG_PTR{6}, ULONG_PTR{7}, ULONG_PTR{0x12}}) {
+    monitorState.stateBlock->statusWord = 101;
+    const DWORD before = monitorState.rescanCount;
+    HandleForwardedMessage(0x218, resume, 0, nullptr);
+    StateBlock* block = monitorState.stateBlock;
+    EXPECT_EQ(monitorState.rescanCount, before + 1) << resume;
+    EXPECT_EQ(block->statusWord, 102u);
+    EXPECT_EQ(monitorState.rescanInProgress, 0u);
+    // No drive and no channel is present here: the rebuilt tables are empty.
+    EXPECT_EQ(block->driveCount, 0);
+    EXPECT_EQ(block->channelCount, 0);
+    EXPECT_EQ(block->channels[0].linkedDrive, -1);
+    EXPECT_EQ(block->channels[0].gaugePercentSent, 0u);
+  }
+}
+
+TEST_F(Rescan, OtherMessagesChangeNothing) {
+  HandleForwardedMessage(0x218, 5, 0, nullptr);
+  HandleForwardedMessage(0x100, 7, 0, nullptr);
+  EXPECT_EQ(monitorState.stateBlock->statusWord, 101u);
+  EXPECT_EQ(monitorState.stateBlock->drives[0].gaugePercent, 40u);
+  EXPECT_EQ(monitorState.rescanCount, 0u);
+}
+
+TEST_F(Rescan, ForwardedDeviceChangeIsClassifiedWithoutItsRecord) {
+  // The second parameter points into the application's memory: never read.
+  HandleForwardedMessage(0x219, 0x8004, 0x12345678, nullptr);
+  EXPECT_EQ(monitorState.removalCheckRequested, 1u);
+  HandleForwardedMessage(0x219, 0x8000, 0x12345678, nullptr);
+  EXPECT_EQ(monitorState.refreshRequests, 1u);
+}
+
+TEST_F(Rescan, StopWorkersWithNoneRunningOnlySets102) {
+  EXPECT_EQ(StopWorkers(), 0u);
+  EXPECT_EQ(monitorState.stateBlock->statusWord, 102u);
+}
+
+TEST_F(Rescan, CountedDrivesCheckReportsUncountedDrivesAndSets102Once) {
+  StateBlock* block = monitorState.stateBlock;
+  block->countedDrives = 1;
+  EXPECT_FALSE(CountedDrivesCheck());
+  EXPECT_EQ(block->statusWord, 100u);
+  block->countedDrives = 2;
+  EXPECT_TRUE(CountedDrivesCheck());
+  EXPECT_EQ(block->statusWord, 102u);
+  block->statusWord = 600;
+  EXPECT_TRUE(CountedDrivesCheck());
+  EXPECT_EQ(block->statusWord, 600u) << "102 is set only when the flag was clear";
+}
+
+}  // namespace

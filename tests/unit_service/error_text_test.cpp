@@ -1,0 +1,62 @@
+#include <gtest/gtest.h>
+
+#include "platform/wide.h"
+#include "service/service_host.h"
+#include "service/service_main.h"
+
+namespace {
+
+std::string TextFor(DWORD error, DWORD bufferBytes) {
+  WCHAR buffer[128];
+  buffer[0] = 'x';
+  SetLastError(error);
+  const WCHAR* result = LastErrorText(buffer, bufferBytes);
+  EXPECT_EQ(result, buffer);
+  return WideToUtf8(WideView(buffer));
+}
+
+TEST(LastErrorText, SystemTextWithoutLineBreakThenHexCode) {
+  const std::string text = TextFor(ERROR_SERVICE_EXISTS, 256);
+  ASSERT_GT(text.size(), 8u);
+  EXPECT_EQ(text.substr(text.size() - 8), " (0x431)");
+  EXPECT_EQ(text.find('\r'), std::string::npos);
+  EXPECT_EQ(text.find('\n'), std::string::npos);
+  EXPECT_NE(text[0], ' ');
+}
+
+TEST(LastErrorText, EmptyWhenTheTextDoesNotFitOrDoesNotExist) {
+  // The system text with its line break is the result less " (0x431)" plus 2.
+  const std::size_t textLength = TextFor(ERROR_SERVICE_EXISTS, 256).size() - 8 + 2;
+  // The text may take up the buffer's size in bytes less 14, no more.
+  EXPECT_EQ(TextFor(ERROR_SERVICE_EXISTS, static_cast<DWORD>(textLength + 13)), "");
+  EXPECT_NE(TextFor(ERROR_SERVICE_EXISTS, static_cast<DWORD>(textLength + 14)), "");
+  // A code with no system message.
+  EXPECT_EQ(TextFor(0x20001234, 256), "");
+}
+
+TEST(LastErrorText, CutToTheBufferAndTerminated) {
+  WCHAR buffer[128];
+  for (WCHAR& unit : buffer) unit = 'x';
+  SetLastError(ERROR_SERVICE_EXISTS);
+  const std::size_t full = WideLength(LastErrorText(buffer, 256));
+  ASSERT_GT(full, 10u);
+  // A buffer of exactly as many bytes as the text leaves one unit short,
+  // as long as the text still passes the 14-byte margin.
+  for (WCHAR& unit : buffer) unit = 'x';
+  const DWORD bytes = static_cast<DWORD>(full * sizeof(WCHAR));
+  SetLastError(ERROR_SERVICE_EXISTS);
+  LastErrorText(buffer, bytes);
+  EXPECT_EQ(WideLength(buffer, 128), full - 1);
+  EXPECT_EQ(buffer[full], 'x') << "wrote beyond the stated buffer size";
+}
+
+TEST(ReportServiceStatus, DebugModeReportsNothing) {
+  const bool saved = debugMode;
+  debugMode = true;
+  const DWORD checkPoint = nextCheckPoint;
+  EXPECT_TRUE(ReportServiceStatus(SERVICE_START_PENDING, 0, 3000));
+  EXPECT_EQ(nextCheckPoint, checkPoint);
+  debugMode = saved;
+}
+
+}  // namespace

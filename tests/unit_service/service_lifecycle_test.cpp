@@ -1,0 +1,155 @@
+// The service main function under the emulated service control manager.
+#include <condition_variable>
+#include <mutex>
+#include <thread>
+
+#include "monitor/monitor_state.h"
+#include "monitor/state_lock.h"
+#include "service/device_notifications.h"
+#include "service/interface_classes.h"
+#include "service/service_main.h"
+#include "service_test_support.h"
+
+namespace {
+
+using servicetest::States;
+
+// Follows the monitor's completed rescans through its pass hook.
+struct RescanProbe {
+  std::mutex lock;
+  std::condition_variable changed;
+  DWORD rescans = 0;
+};
+RescanProbe probe;
+
+void CountRescans(PassKind) {
+  DWORD rescans;
+  {
+    StateLock lock;
+    rescans = monitorState.rescanCount;
+  }
+  std::lock_guard<std::mutex> guard(probe.lock);
+  probe.rescans = rescans;
+  probe.changed.notify_all();
+}
+
+class ServiceLifecycle : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    debugMode = false;
+    lastError = 0;
+    emu::BeginServiceSession();
+    emu::ClearEventLog();
+    monitorHooks.afterPass = CountRescans;
+  }
+  void TearDown() override {
+    if (entry_.joinable()) {
+      emu::SendServiceControl(SERVICE_CONTROL_STOP);
+      entry_.join();
+    }
+    emu::EndServiceSession();
+    monitorHooks.afterPass = nullptr;
+  }
+  void StartService() {
+    entry_ = std::thread([] { servicetest::RunEntry({}); });
+  }
+  void JoinEntry() {
+    ASSERT_TRUE(emu::WaitForDispatcherReturn());
+    entry_.join();
+  }
+  bool WaitForRescans(DWORD count) {
+    std::unique_lock<std::mutex> guard(probe.lock);
+    return probe.changed.wait_for(guard, std::chrono::seconds(30),
+                                  [&] { return probe.rescans >= count; });
+  }
+  std::thread entry_;
+};
+
+TEST_F(ServiceLifecycle, StartAndStopReportInOrderWithGrowingCheckPoints) {
+  StartService();
+  ASSERT_TRUE(emu::WaitForServiceState(SERVICE_RUNNING));
+  const std::size_t beforeInterrogate = emu::ServiceStatusReports().size();
+  ASSERT_TRUE(emu::SendServiceControl(SERVICE_CONTROL_INTERROGATE).delivered);
+  ASSERT_TRUE(emu::SendServiceControl(SERVICE_CONTROL_STOP).delivered);
+  JoinEntry();
+
+  const std::vector<SERVICE_STATUS> reports = emu::ServiceStatusReports();
+  ASSERT_EQ(beforeInterrogate, 3u);
+  const std::vector<DWORD> expected = {
+      SERVICE_START_PENDING, SERVICE_START_PENDING, SERVICE_RUNNING, SERVICE_RUNNING,
+      SERVICE_STOP_PENDING,  SERVICE_STOP_PENDING,  SERVICE_STOPPED};
+  ASSERT_EQ(States(reports), expected);
+  // Pending states carry growing check points; running and stopped carry 0.
+  EXPECT_GT(reports[0].dwCheckPoint, 0u);
+  EXPECT_GT(reports[1].dwCheckPoint, reports[0].dwCheckPoint);
+  EXPECT_GT(reports[4].dwCheckPoint, reports[1].dwCheckPoint);
+  EXPECT_GT(reports[5].dwCheckPoint, reports[4].dwCheckPoint);
+  EXPECT_EQ(reports[2].dwCheckPoint, 0u);
+  EXPECT_EQ(reports[3].dwCheckPoint, 0u) << "interrogate must not take a new check point";
+  EXPECT_EQ(reports[6].dwCheckPoint, 0u);
+  EXPECT_EQ(reports[0].dwWaitHint, 3000u);
+  EXPECT_EQ(reports[1].dwWaitHint, 3000u);
+  for (std::size_t i = 0; i < reports.size(); ++i) {
+    EXPECT_EQ(reports[i].dwServiceType, static_cast<DWORD>(SERVICE_WIN32_OWN_PROCESS));
+    const DWORD accepted =
+        reports[i].dwCurrentState == SERVICE_START_PENDING ? 0 : SERVICE_ACCEPT_STOP;
+    EXPECT_EQ(reports[i].dwControlsAccepted, accepted) << "report " << i;
+    EXPECT_EQ(reports[i].dwWin32ExitCode, 0u) << "report " << i;
+  }
+  EXPECT_EQ(emu::LiveDeviceNotificationCount(), 0u);
+  EXPECT_TRUE(emu::EventLogEntries().empty());
+}
+
+TEST_F(ServiceLifecycle, NullEighthRegistrationRemovesTheSevenAndSkipsTheMonitor) {
+  emu::FailDeviceNotificationRegistration(8);
+  StartService();
+  JoinEntry();
+  const std::vector<SERVICE_STATUS> reports = emu::ServiceStatusReports();
+  const std::vector<DWORD> expected = {SERVICE_START_PENDING, SERVICE_STOPPED};
+  EXPECT_EQ(States(reports), expected);
+  EXPECT_EQ(emu::LiveDeviceNotificationCount(), 0u);
+  EXPECT_EQ(notificationTable.count, 0);
+  for (HDEVNOTIFY handle : notificationTable.handles) EXPECT_EQ(handle, nullptr);
+}
+
+TEST_F(ServiceLifecycle, FailedStartReportIsLoggedAndBecomesTheExitCode) {
+  emu::FailSetServiceStatus(1, 1, ERROR_INVALID_DATA);
+  StartService();
+  JoinEntry();
+  const std::vector<SERVICE_STATUS> reports = emu::ServiceStatusReports();
+  ASSERT_EQ(States(reports), std::vector<DWORD>{SERVICE_STOPPED});
+  EXPECT_EQ(reports[0].dwWin32ExitCode, static_cast<DWORD>(ERROR_INVALID_DATA));
+  const std::vector<emu::EventLogEntry> log = emu::EventLogEntries();
+  ASSERT_EQ(log.size(), 1u);
+  EXPECT_EQ(servicetest::Utf8(log[0].source), "SkyvaneSvc");
+  EXPECT_EQ(log[0].type, EVENTLOG_ERROR_TYPE);
+  ASSERT_EQ(log[0].strings.size(), 2u);
+  EXPECT_EQ(servicetest::Utf8(log[0].strings[0]), "SkyvaneSvc error: 13");
+  EXPECT_EQ(servicetest::Utf8(log[0].strings[1]), "SetServiceStatus");
+}
+
+TEST_F(ServiceLifecycle, DeviceEventReachesTheMonitorAndReReportsTheState) {
+  StartService();
+  ASSERT_TRUE(emu::WaitForServiceState(SERVICE_RUNNING));
+  ASSERT_TRUE(WaitForRescans(1));
+  DWORD rescans;
+  {
+    std::lock_guard<std::mutex> guard(probe.lock);
+    rescans = probe.rescans;
+  }
+  const std::size_t before = emu::ServiceStatusReports().size();
+  DEV_BROADCAST_DEVICEINTERFACE_W record = {};
+  record.dbcc_size = sizeof(record);
+  record.dbcc_devicetype = DBT_DEVTYP_DEVICEINTERFACE;
+  record.dbcc_classguid = kDiskInterfaceClass;
+  const emu::DeviceEventOutcome outcome = emu::DeliverDeviceEvent(DBT_DEVICEARRIVAL, &record);
+  EXPECT_EQ(outcome.recipients, 1);
+  // A disk arrival requests a refresh: the loop runs one more full rescan.
+  EXPECT_TRUE(WaitForRescans(rescans + 1));
+  const std::vector<SERVICE_STATUS> reports = emu::ServiceStatusReports();
+  ASSERT_GT(reports.size(), before);
+  EXPECT_EQ(reports[before].dwCurrentState, static_cast<DWORD>(SERVICE_RUNNING));
+  EXPECT_EQ(reports[before].dwCheckPoint, 0u);
+}
+
+}  // namespace
