@@ -1,0 +1,58 @@
+// SCSI pass-through to a disk or an enclosure-services device, and the
+// generic device I/O control with an abortable overlapped wait. Every
+// operation takes an open handle; none opens or closes devices.
+//
+// Abort: when the abort event is signalled while a request is pending, the
+// handle's I/O is cancelled and 3000 ms are granted for the cancellation.
+// A device slow to cancel may still write into the request block, the
+// OVERLAPPED record and the data buffer after that grace, so the operation
+// then goes on waiting for the completion, without limit, before it frees
+// anything and returns. The port driver ends every pass-through at the
+// latest with its own command time-out, so the wait is bounded in practice.
+#pragma once
+
+#include <cstddef>
+
+#include "platform/win32.h"
+
+// The block handed to IOCTL_SCSI_PASS_THROUGH_DIRECT as both the input and
+// the output buffer: the platform's structure, the block length and the
+// sense buffer the port driver fills.
+struct PassThroughRequest {
+  SCSI_PASS_THROUGH_DIRECT spt;
+  DWORD totalLength;  // sizeof(PassThroughRequest)
+  BYTE sense[20];
+};
+
+static_assert(sizeof(PassThroughRequest) == 80);
+static_assert(offsetof(PassThroughRequest, spt) == 0);
+static_assert(sizeof(SCSI_PASS_THROUGH_DIRECT) == 56);
+static_assert(offsetof(PassThroughRequest, totalLength) == 56);
+static_assert(offsetof(PassThroughRequest, sense) == 60);
+
+constexpr DWORD kCancelGraceMs = 3000;
+constexpr BYTE kInquiryLength = 74;
+
+// Issues the control with an own overlapped record and waits for it or for
+// abortEvent (may be null). bytesReturned (may be null) receives the count
+// transferred, 0 after a failure or an abort. An abort sets last error 995.
+bool IoControlWait(HANDLE device, DWORD controlCode, void* input, DWORD inputLength, void* output,
+                   DWORD outputLength, DWORD* bytesReturned, HANDLE abortEvent);
+
+// The SCSI commands. Each returns a Win32 error code, 0 on success.
+// READ CAPACITY(10): both outputs in host order, written only on success.
+DWORD ScsiReadCapacity(HANDLE device, DWORD* lastLba, DWORD* blockLength, HANDLE abortEvent);
+// Standard INQUIRY into buffer[kInquiryLength].
+DWORD ScsiInquiry(HANDLE device, BYTE* buffer, HANDLE abortEvent);
+// INQUIRY of a vital-product-data page into buffer[length].
+DWORD ScsiInquiryPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE length, HANDLE abortEvent);
+
+// The diagnostic pages, on the caller's overlapped record (its event may be
+// null for a handle opened without overlapped I/O). A transfer that was
+// started but did not complete successfully reports ERROR_IO_PENDING (997);
+// the thread's last error then tells the cause (995 after an abort).
+DWORD ReceiveDiagnosticPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE length,
+                            OVERLAPPED* overlapped, HANDLE abortEvent);
+// buffer holds the whole page, header included.
+DWORD SendDiagnosticPage(HANDLE device, const BYTE* buffer, BYTE length, OVERLAPPED* overlapped,
+                         HANDLE abortEvent);

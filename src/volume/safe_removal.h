@@ -1,0 +1,8 @@
+// Safe removal and eject of a drive.
+#pragma once
+
+#include "discovery/drive_record.h"
+#include "transport/channel_record.h"
+
+// 1 when the drive was removed, 0 when not. drive is a private copy; mutex held.
+int SafeRemoveDrive(DriveRecord* drive, ChannelRecord* channel);

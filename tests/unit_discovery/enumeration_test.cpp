@@ -1,0 +1,273 @@
+// Drive enumeration against simulated disks: which disks become drive
+// records, and what their records hold.
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <string>
+
+#include "discovery/control_interface.h"
+#include "discovery/disk_number.h"
+#include "discovery/drive_enumeration.h"
+#include "discovery/model_table.h"
+#include "discovery_fixture.h"
+#include "service/interface_classes.h"
+
+namespace disctest {
+namespace {
+
+using EnumerationTest = DiscoveryTest;
+
+TEST_F(EnumerationTest, OnlyInterfacePathsOfTheMakersDrivesAreExamined) {
+  sim::DriveSpec usbWithoutMaker = UsbDrive("no-qx", "7B44", "4E4F5158");
+  usbWithoutMaker.diskPath =
+      "\\\\?\\usbstor#disk&ven_acme&prod_external_hdd#4e4f5158&0#{53f56307-b6bf-11d0-94f2-"
+      "00a0c91efb8b}";
+  sim::DriveSpec fireWireNoLine = FireWireDrive("no-line", "5E22", "0030E00000000001");
+  fireWireNoLine.diskPath =
+      "\\\\?\\sbp2#orvanel&backup_disk&lun0#0030e00000000001#{53f56307-b6bf-11d0-94f2-"
+      "00a0c91efb8b}";
+  sim::DriveSpec fireWireRambler = FireWireDrive("rambler", "5E22", "0030E00000000002");
+  fireWireRambler.diskPath =
+      "\\\\?\\sbp2#orvanel&rambler&lun0#0030e00000000002#{53f56307-b6bf-11d0-94f2-00a0c91efb8b}";
+  sim::DriveSpec usb = UsbDrive("usb", "7B44", "37484B32");
+  machine_.AddDrive(usbWithoutMaker);
+  machine_.AddDrive(fireWireNoLine);
+  machine_.AddDrive(fireWireRambler);
+  machine_.AddDrive(usb);
+  Install();
+
+  EXPECT_EQ(EnumerateDrives(nullptr), 0);
+  ASSERT_EQ(Block().driveCount, 2);
+  EXPECT_EQ(N(Drive(0).diskPath), fireWireRambler.diskPath);
+  EXPECT_EQ(Drive(0).busKind, 3u);
+  EXPECT_EQ(Drive(0).recordIndex, 0);
+  EXPECT_EQ(N(Drive(1).diskPath), usb.diskPath);
+  EXPECT_EQ(Drive(1).busKind, 2u);
+  EXPECT_EQ(Drive(1).recordIndex, 1);
+  // The skipped disks were never opened.
+  EXPECT_TRUE(machine_.Commands("no-qx").empty());
+  EXPECT_TRUE(machine_.Commands("no-line").empty());
+}
+
+TEST_F(EnumerationTest, AdditionalLengthBelow32SkipsTheDisk) {
+  sim::DriveSpec short31 = UsbDrive("short", "7B44", "3331");
+  short31.additionalLength = 31;
+  sim::DriveSpec enough32 = UsbDrive("enough", "7B44", "3332");
+  enough32.additionalLength = 32;
+  machine_.AddDrive(short31);
+  machine_.AddDrive(enough32);
+  Install();
+
+  EnumerateDrives(nullptr);
+  ASSERT_EQ(Block().driveCount, 1);
+  EXPECT_EQ(N(Drive(0).diskPath), enough32.diskPath);
+  // Nothing of the skipped disk shows in the slot it was read into.
+  EXPECT_EQ(Drive(1).diskPath[0], 0);
+  EXPECT_EQ(Drive(1).busKind, 0u);
+}
+
+TEST_F(EnumerationTest, SerialTextOfOnlyThePrefixBecomesNaWithoutAsciiPages) {
+  sim::DriveSpec spec = FireWireDrive("bare", "5E24", "0030E0000000BA5E");
+  spec.serial = "QX-";
+  spec.vpdPages = {0x00, 0x80, 0x83, 0xC0};  // page list without 0x01 and 0x02
+  spec.unitSerial = "UNITSER1";
+  machine_.AddDrive(spec);
+  Install();
+
+  EnumerateDrives(nullptr);
+  ASSERT_EQ(Block().driveCount, 1);
+  const DriveRecord& drive = Drive(0);
+  EXPECT_EQ(drive.extendedIdentity, 1u);
+  EXPECT_EQ(N(drive.serialNumber), "NA");  // page 0x80 is not read either
+  EXPECT_EQ(N(drive.firmwareSerial), "QX-");
+  EXPECT_EQ(N(drive.firmwareSerialHex), "51582D");
+  EXPECT_EQ(drive.asciiInfo1[0], 0);
+  EXPECT_EQ(drive.asciiInfo2[0], 0);
+  EXPECT_EQ(drive.vendorCode[0], 0);
+}
+
+TEST_F(EnumerationTest, ModelKeySelectsTheModelRow) {
+  sim::DriveSpec blank = FireWireDrive("blank", "    ", "0030E00000000B1A");
+  sim::DriveSpec flagged = FireWireDrive("flagged", "5E24", "0030E00000000F1A");
+  flagged.rcsIdentity = false;  // extended identity from the row's flag alone
+  sim::DriveSpec rambler = FireWireDrive("rambler", "3C13", "0030E0000000AB1E");
+  sim::DriveSpec named = FireWireDrive("named", "3C14", "0030E0000000AB1F");
+  named.friendlyName = "My Rambler drive";
+  machine_.AddDrive(blank);
+  machine_.AddDrive(flagged);
+  machine_.AddDrive(rambler);
+  machine_.AddDrive(named);
+  Install();
+
+  EnumerateDrives(nullptr);
+  ASSERT_EQ(Block().driveCount, 4);
+  // Four spaces make an empty key, which selects the first row.
+  EXPECT_EQ(N(Drive(0).modelSuffixRef), "_2A30");
+  EXPECT_EQ(N(Drive(0).modelCode), "    ");
+  EXPECT_EQ(N(Drive(1).modelSuffixRef), "_5E24");
+  EXPECT_EQ(Drive(1).modelFlags, 0x10u);
+  EXPECT_EQ(Drive(1).gaugeSegments, 6u);
+  EXPECT_EQ(Drive(1).extendedIdentity, 1u);
+  EXPECT_EQ(N(Drive(2).modelSuffixRef), "_3C13");
+  EXPECT_EQ(N(Drive(2).productLineRef), "Rambler");
+  EXPECT_EQ(N(Drive(2).friendlyName), "Rambler");
+  EXPECT_EQ(N(Drive(3).friendlyName), "My Rambler drive");  // already names the line
+}
+
+TEST_F(EnumerationTest, UsbDiskNeedsAModelSuffixInItsParent) {
+  sim::DriveSpec orphan = UsbDrive("orphan", "7B44", "4F525048");
+  orphan.parentInstanceId = "USB\\VID_1A2B&PID_9999&MI_00\\6&2A0B&0&0000";
+  orphan.asciiInfo1 = "ORPHAN INFO";
+  sim::DriveSpec plain = UsbDrive("plain", "2A31", "504C4149");
+  plain.rcsIdentity = false;  // no extended identity: no vendor pages read
+  machine_.AddDrive(orphan);
+  machine_.AddDrive(plain);
+  Install();
+
+  EnumerateDrives(nullptr);
+  ASSERT_EQ(Block().driveCount, 1);
+  const DriveRecord& drive = Drive(0);
+  EXPECT_EQ(N(drive.diskPath), plain.diskPath);
+  EXPECT_EQ(drive.asciiInfo1[0], 0);
+  // The parent's row replaces the one of the model code.
+  EXPECT_EQ(N(drive.modelSuffixRef), "_2A31");
+  // 2A31 is not in the channel-model list: not counted.
+  EXPECT_EQ(Block().countedDrives, 0);
+  EXPECT_EQ(Drive(1).busKind, 0u);
+}
+
+TEST_F(EnumerationTest, SeventyDisksCountSixtyThreeAndKeepTheLastInTheScratchSlot) {
+  constexpr int kDisks = 70;
+  for (int i = 0; i < kDisks; ++i) {
+    char serial[16];
+    std::snprintf(serial, sizeof(serial), "5345%04d", i);
+    sim::DriveSpec spec = UsbDrive("d" + std::to_string(i), "7B44", serial);
+    spec.rcsIdentity = false;
+    machine_.AddDrive(spec);
+  }
+  Install();
+
+  EXPECT_EQ(EnumerateDrives(nullptr), 0);
+  EXPECT_EQ(Block().driveCount, 63);
+  EXPECT_EQ(Block().countedDrives, kDisks);  // every parent is of a channel model
+  for (int i = 0; i < 63; ++i) {
+    char serial[16];
+    std::snprintf(serial, sizeof(serial), "5345%04d", i);
+    EXPECT_TRUE(WideContains(Drive(i).deviceIdUpper, W(serial).c_str())) << i;
+  }
+  EXPECT_TRUE(WideContains(Drive(63).deviceIdUpper, WSTR("53450069")));
+  EXPECT_EQ(Drive(63).recordIndex, 63);
+}
+
+TEST_F(EnumerationTest, FailedDeviceNumberQueryGivesANumberNoVolumeCarries) {
+  sim::DriveSpec spec = UsbDrive("nonumber", "7B44", "4E4E");
+  machine_.AddDrive(spec);
+  machine_.FailIo("nonumber", sim::Endpoint::Disk, ERROR_NOT_READY, -1,
+                  IOCTL_STORAGE_GET_DEVICE_NUMBER);
+  Install();
+
+  EnumerateDrives(nullptr);
+  ASSERT_EQ(Block().driveCount, 1);
+  EXPECT_EQ(Drive(0).diskNumber, kUnknownDiskNumber);
+}
+
+TEST_F(EnumerationTest, OpenFailureOrInquiryFailureSkipsTheDisk) {
+  machine_.AddDrive(UsbDrive("closed", "7B44", "434C"));
+  machine_.AddDrive(UsbDrive("mute", "7B44", "4D55"));
+  machine_.AddDrive(UsbDrive("fine", "7B44", "4649"));
+  machine_.FailOpen("closed", sim::Endpoint::Disk, ERROR_ACCESS_DENIED);
+  machine_.FailIo("mute", sim::Endpoint::Disk, ERROR_NOT_READY, -1, 0x12);
+  Install();
+
+  EnumerateDrives(nullptr);
+  ASSERT_EQ(Block().driveCount, 1);
+  EXPECT_TRUE(WideContains(Drive(0).deviceIdUpper, WSTR("4649")));
+  EXPECT_EQ(machine_.OpenCount("mute", sim::Endpoint::Disk), 0u);  // closed after the failure
+}
+
+TEST_F(EnumerationTest, Windows2000FindsTheControlInterfaceBySerialKey) {
+  sim::DriveSpec first = UsbDrive("first", "7B44", "A1B2C3");
+  first.channel = sim::ChannelKind::Driver;
+  first.driverClass = 3;
+  first.controlInstanceId = "USBSTOR\\OTHER&VEN_QX&PROD_QUARRY\\A1B2C3&0";
+  sim::DriveSpec second = UsbDrive("second", "7B44", "D4E5F6");
+  second.channel = sim::ChannelKind::Driver;
+  second.driverClass = 3;
+  second.controlInstanceId = "USBSTOR\\OTHER&VEN_QX&PROD_QUARRY\\D4E5F6&0";
+  sim::DriveSpec enclosure = FireWireDrive("enclosure", "3C13", "0030E00000045D6F");
+  enclosure.channel = sim::ChannelKind::Enclosure;
+  enclosure.enclosureClass = 3;
+  enclosure.controlInstanceId = "SBP2\\QX&QUARRY_SES&LUN1\\0030E00000045D6F";
+  machine_.AddDrive(first);
+  machine_.AddDrive(second);
+  machine_.AddDrive(enclosure);
+  Install();
+
+  monitorState.osKind = kOsWindows2000;
+  EnumerateDrives(nullptr);
+  ASSERT_EQ(Block().driveCount, 3);
+  const std::string classC = "#{1d9c4e6a-73b2-4f05-a6e8-5b20c9d41f7e}";
+  EXPECT_EQ(N(Drive(0).controlPath), "\\\\?\\usbstor#other&ven_qx&prod_quarry#a1b2c3&0" + classC);
+  EXPECT_EQ(N(Drive(1).controlPath), "\\\\?\\usbstor#other&ven_qx&prod_quarry#d4e5f6&0" + classC);
+  EXPECT_EQ(N(Drive(2).controlPath), "\\\\?\\sbp2#qx&quarry_ses&lun1#0030e00000045d6f" + classC);
+
+  // Later systems fill the control path only when a channel is bound.
+  monitorState.osKind = kOsXpOrLater;
+  EnumerateDrives(nullptr);
+  ASSERT_EQ(Block().driveCount, 3);
+  for (int i = 0; i < 3; ++i) EXPECT_EQ(Drive(i).controlPath[0], 0) << i;
+}
+
+TEST_F(EnumerationTest, HidControlInterfaceIsFoundThroughItsCompositeDevice) {
+  machine_.AddDrive(UsbDrive("usb", "7B44", "C0FFEE12"));
+  // Two HID collections exposing the control class: one of another USB
+  // device, listed first, and the one of this drive's composite device.
+  const char* const serials[2] = {"BADBEEF0", "C0FFEE12"};
+  for (int i = 0; i < 2; ++i) {
+    const DEVINST composite =
+        machine_.AddNode(machine_.RootNode(), std::string("USB\\VID_1A2B&PID_7B44\\") + serials[i],
+                         "USB Composite Device");
+    const DEVINST function = machine_.AddNode(
+        composite, "USB\\VID_1A2B&PID_7B44&MI_01\\6&" + std::to_string(i) + "&0&0001",
+        "USB Input Device");
+    const DEVINST hid = machine_.AddNode(
+        function, "HID\\VID_1A2B&PID_7B44&MI_01\\7&" + std::to_string(i) + "&0&0000",
+        "HID-compliant device");
+    machine_.AddInterface(hid, sim::kVendorClassC);
+  }
+  Install();
+
+  monitorState.osKind = kOsWindows2000;
+  EnumerateDrives(nullptr);
+  ASSERT_EQ(Block().driveCount, 1);
+  EXPECT_EQ(N(Drive(0).controlPath),
+            "\\\\?\\hid#vid_1a2b&pid_7b44&mi_01#7&1&0&0000#{1d9c4e6a-73b2-4f05-a6e8-5b20c9d41f7e}");
+
+  // An empty key would be contained in any composite device's ID.
+  WCHAR path[256] = {};
+  EXPECT_EQ(FindControlInterfacePath(kVendorClassC, WSTR(""), path, 256), -1);
+  EXPECT_EQ(path[0], 0);
+  EXPECT_EQ(FindControlInterfacePath(kVendorClassC, WSTR("BADBEEF0"), path, 256), 0);
+}
+
+TEST_F(EnumerationTest, NoDiskLeavesEverythingZero) {
+  std::memset(&Block().drives[5], 0xAB, sizeof(DriveRecord));
+  std::memset(&Block().published[7], 0xCD, sizeof(DriveRecord));
+  Block().driveCount = 9;
+  Block().countedDrives = 4;
+  Block().publishedCount = 8;
+  Install();
+
+  EXPECT_EQ(EnumerateDrives(nullptr), -1);
+  EXPECT_EQ(Block().driveCount, 0);
+  EXPECT_EQ(Block().countedDrives, 0);
+  EXPECT_EQ(Block().publishedCount, 0);
+  const DriveRecord zero{};
+  for (int i = 0; i < kMaxDrives; ++i) {
+    EXPECT_EQ(std::memcmp(&Block().drives[i], &zero, sizeof(zero)), 0) << i;
+    EXPECT_EQ(std::memcmp(&Block().published[i], &zero, sizeof(zero)), 0) << i;
+  }
+}
+
+}  // namespace
+}  // namespace disctest

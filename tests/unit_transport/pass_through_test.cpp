@@ -1,0 +1,255 @@
+// The SCSI pass-through transport against a simulated drive: the command
+// blocks the drive receives, the replies, device errors, and the abort of a
+// pending transfer, including a device that is slow to cancel.
+#include "transport/pass_through.h"
+
+#include <gtest/gtest.h>
+
+#include <thread>
+#include <vector>
+
+#include "discovery/device_interfaces.h"
+#include "machine.h"
+#include "service/process_locks.h"
+#include "support/test_support.h"
+
+namespace {
+
+constexpr char kDrive[] = "disk";
+
+using Bytes = std::vector<std::uint8_t>;
+
+class PassThroughTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    InitializeProcessLocks();
+    sim::DriveSpec spec;
+    spec.name = kDrive;
+    spec.channel = sim::ChannelKind::None;
+    spec.lastLba = 4096;
+    spec.blockLength = 512;
+    machine_.AddDrive(spec);
+    machine_.Install();
+    disk_.Reset(OpenDisk(FILE_FLAG_OVERLAPPED));
+    ASSERT_TRUE(disk_.Valid());
+    abort_.Reset(CreateEventW(nullptr, TRUE, FALSE, nullptr));
+    ownEvent_.Reset(CreateEventW(nullptr, FALSE, FALSE, nullptr));
+    machine_.ClearCommands();
+  }
+
+  void TearDown() override {
+    disk_.Reset();
+    abort_.Reset();
+    ownEvent_.Reset();
+    machine_.Uninstall();
+  }
+
+  HANDLE OpenDisk(DWORD flags) {
+    InterfaceList list(GUID_DEVINTERFACE_DISK);
+    WideString path;
+    SP_DEVINFO_DATA devInfo{};
+    if (!list.Opened() || list.Member(0, &path, &devInfo) != InterfaceList::Fetch::Ok)
+      return nullptr;
+    return CreateFileW(path.c_str(), GENERIC_READ | GENERIC_WRITE,
+                       FILE_SHARE_READ | FILE_SHARE_WRITE, nullptr, OPEN_EXISTING, flags, nullptr);
+  }
+
+  // The descriptor block of the last SCSI command the drive received.
+  Bytes LastCdb() {
+    Bytes cdb;
+    for (const sim::Command& command : machine_.Commands(kDrive)) {
+      if (command.kind == sim::Command::Kind::Scsi) cdb = command.cdb;
+    }
+    return cdb;
+  }
+
+  sim::Machine machine_;
+  skytest::Handle disk_;
+  skytest::Handle abort_;
+  skytest::Handle ownEvent_;
+};
+
+TEST_F(PassThroughTest, CommandsCarryTheirDescriptorBlocksAndReplies) {
+  DWORD lastLba = 0;
+  DWORD blockLength = 0;
+  ASSERT_EQ(ScsiReadCapacity(disk_.Get(), &lastLba, &blockLength, abort_.Get()), 0u);
+  EXPECT_EQ(lastLba, 4096u);  // wire bytes 00 00 10 00 00 00 02 00
+  EXPECT_EQ(blockLength, 512u);
+  EXPECT_EQ(LastCdb(), (Bytes{0x25, 0, 0, 0, 0, 0, 0, 0, 0, 0}));
+
+  BYTE inquiry[kInquiryLength] = {};
+  ASSERT_EQ(ScsiInquiry(disk_.Get(), inquiry, nullptr), 0u);
+  EXPECT_EQ(LastCdb(), (Bytes{0x12, 0x00, 0x00, 0x00, 74, 0x00}));
+  EXPECT_EQ(std::string(reinterpret_cast<char*>(inquiry + 8), 8), "QX      ");
+  EXPECT_EQ(std::string(reinterpret_cast<char*>(inquiry + 36), 4), "7B44");
+
+  BYTE page[20] = {};
+  ASSERT_EQ(ScsiInquiryPage(disk_.Get(), 0xC0, page, sizeof(page), abort_.Get()), 0u);
+  EXPECT_EQ(LastCdb(), (Bytes{0x12, 0x01, 0xC0, 0x00, 20, 0x00}));
+  EXPECT_EQ(page[1], 0xC0);
+  EXPECT_EQ(std::string(reinterpret_cast<char*>(page + 16), 3), "RCS");
+
+  OVERLAPPED overlapped{};
+  overlapped.hEvent = ownEvent_.Get();
+  BYTE status[8] = {};
+  ASSERT_EQ(
+      ReceiveDiagnosticPage(disk_.Get(), 0x82, status, sizeof(status), &overlapped, abort_.Get()),
+      0u);
+  EXPECT_EQ(LastCdb(), (Bytes{0x1C, 0x01, 0x82, 0x00, 8, 0x00}));
+  EXPECT_EQ(status[0], 0x82);
+  EXPECT_EQ(status[4], 0x40);
+
+  const BYTE notice[5] = {0x81, 0x00, 0x00, 0x01, 0x05};
+  overlapped = OVERLAPPED{};
+  overlapped.hEvent = ownEvent_.Get();
+  SetLastError(ERROR_GEN_FAILURE);
+  ASSERT_EQ(SendDiagnosticPage(disk_.Get(), notice, sizeof(notice), &overlapped, nullptr), 0u);
+  EXPECT_EQ(LastCdb(), (Bytes{0x1D, 0x10, 0x00, 0x00, 5, 0x00}));
+  const std::vector<sim::Command> commands = machine_.Commands(kDrive);
+  ASSERT_FALSE(commands.empty());
+  EXPECT_EQ(commands.back().data, Bytes(notice, notice + sizeof(notice)));
+}
+
+TEST_F(PassThroughTest, DeviceErrorsBecomeTheResult) {
+  constexpr DWORD kIoError = ERROR_NOT_READY;
+  machine_.FailIo(kDrive, sim::Endpoint::Disk, kIoError);
+  BYTE inquiry[kInquiryLength] = {};
+  EXPECT_EQ(ScsiInquiry(disk_.Get(), inquiry, abort_.Get()), kIoError);
+  DWORD lastLba = 77;
+  DWORD blockLength = 77;
+  EXPECT_EQ(ScsiReadCapacity(disk_.Get(), &lastLba, &blockLength, nullptr), kIoError);
+  EXPECT_EQ(lastLba, 77u);  // outputs are written only on success
+  EXPECT_EQ(blockLength, 77u);
+
+  STORAGE_DEVICE_NUMBER number{};
+  DWORD bytes = 99;
+  EXPECT_FALSE(IoControlWait(disk_.Get(), IOCTL_STORAGE_GET_DEVICE_NUMBER, nullptr, 0, &number,
+                             sizeof(number), &bytes, abort_.Get()));
+  EXPECT_EQ(bytes, 0u);
+  EXPECT_EQ(GetLastError(), kIoError);
+
+  OVERLAPPED overlapped{};
+  overlapped.hEvent = ownEvent_.Get();
+  BYTE status[8] = {};
+  EXPECT_EQ(ReceiveDiagnosticPage(disk_.Get(), 0x82, status, sizeof(status), &overlapped, nullptr),
+            kIoError);
+}
+
+TEST_F(PassThroughTest, SynchronousHandleWithoutEventCompletesInline) {
+  skytest::Handle syncDisk(OpenDisk(0));
+  ASSERT_TRUE(syncDisk.Valid());
+  OVERLAPPED overlapped{};  // no event: the handle is not overlapped
+  BYTE status[8] = {};
+  EXPECT_EQ(ReceiveDiagnosticPage(syncDisk.Get(), 0x82, status, sizeof(status), &overlapped,
+                                  abort_.Get()),
+            0u);
+  EXPECT_EQ(status[0], 0x82);
+
+  machine_.FailIo(kDrive, sim::Endpoint::Disk, ERROR_GEN_FAILURE, 1);
+  overlapped = OVERLAPPED{};
+  const BYTE page[5] = {0x80, 0x00, 0x00, 0x01, 0x00};
+  EXPECT_EQ(SendDiagnosticPage(syncDisk.Get(), page, sizeof(page), &overlapped, nullptr),
+            DWORD{ERROR_GEN_FAILURE});
+
+  STORAGE_DEVICE_NUMBER number{};
+  DWORD bytes = 0;
+  ASSERT_TRUE(IoControlWait(syncDisk.Get(), IOCTL_STORAGE_GET_DEVICE_NUMBER, nullptr, 0, &number,
+                            sizeof(number), &bytes, nullptr));
+  EXPECT_EQ(bytes, sizeof(number));
+  EXPECT_EQ(number.DeviceNumber, machine_.DiskNumber(kDrive));
+}
+
+// Runs `operation` on its own thread while the disk holds every request
+// pending, checks what the pass-through lock looks like meanwhile, then
+// signals the abort event and returns the operation's result and last error.
+struct AbortOutcome {
+  DWORD result = 0;
+  DWORD lastError = 0;
+};
+
+template <typename Operation>
+AbortOutcome AbortWhilePending(sim::Machine& machine, HANDLE abortEvent, bool expectLockHeld,
+                               Operation operation) {
+  machine.HangIo(kDrive, sim::Endpoint::Disk, true);
+  AbortOutcome outcome;
+  std::thread worker([&] {
+    outcome.result = operation();
+    outcome.lastError = GetLastError();
+  });
+  EXPECT_TRUE(machine.WaitForPending(kDrive, sim::Endpoint::Disk, 1, skytest::kGuardMs));
+  // The request is pending now, inside the operation.
+  const bool entered = TryEnterCriticalSection(&passThroughLock) != FALSE;
+  if (entered) LeaveCriticalSection(&passThroughLock);
+  EXPECT_EQ(entered, !expectLockHeld);
+  SetEvent(abortEvent);
+  worker.join();
+  EXPECT_EQ(machine.PendingCount(kDrive, sim::Endpoint::Disk), 0u);
+  machine.HangIo(kDrive, sim::Endpoint::Disk, false);
+  ResetEvent(abortEvent);
+  return outcome;
+}
+
+TEST_F(PassThroughTest, AbortEndsAPendingTransfer) {
+  const HANDLE disk = disk_.Get();
+  const HANDLE abortEvent = abort_.Get();
+
+  DWORD bytes = 55;
+  STORAGE_DEVICE_NUMBER number{};
+  AbortOutcome outcome = AbortWhilePending(machine_, abortEvent, false, [&] {
+    return IoControlWait(disk, IOCTL_STORAGE_GET_DEVICE_NUMBER, nullptr, 0, &number, sizeof(number),
+                         &bytes, abortEvent)
+               ? 1u
+               : 0u;
+  });
+  EXPECT_EQ(outcome.result, 0u);
+  EXPECT_EQ(outcome.lastError, DWORD{ERROR_OPERATION_ABORTED});
+  EXPECT_EQ(bytes, 0u);
+
+  BYTE inquiry[kInquiryLength] = {};
+  outcome = AbortWhilePending(machine_, abortEvent, true,
+                              [&] { return ScsiInquiry(disk, inquiry, abortEvent); });
+  EXPECT_EQ(outcome.result, DWORD{ERROR_OPERATION_ABORTED});
+
+  DWORD lastLba = 0;
+  DWORD blockLength = 0;
+  outcome = AbortWhilePending(machine_, abortEvent, false, [&] {
+    return ScsiReadCapacity(disk, &lastLba, &blockLength, abortEvent);
+  });
+  EXPECT_EQ(outcome.result, DWORD{ERROR_OPERATION_ABORTED});
+
+  OVERLAPPED overlapped{};
+  overlapped.hEvent = ownEvent_.Get();
+  BYTE status[8] = {};
+  outcome = AbortWhilePending(machine_, abortEvent, true, [&] {
+    return ReceiveDiagnosticPage(disk, 0x82, status, sizeof(status), &overlapped, abortEvent);
+  });
+  EXPECT_EQ(outcome.result, DWORD{ERROR_IO_PENDING});
+  EXPECT_EQ(outcome.lastError, DWORD{ERROR_OPERATION_ABORTED});
+  EXPECT_TRUE(HasOverlappedIoCompleted(&overlapped));
+
+  // The handle stays usable after an abort.
+  EXPECT_EQ(ScsiInquiry(disk, inquiry, abortEvent), 0u);
+}
+
+TEST_F(PassThroughTest, SlowCancellationIsWaitedOutBeforeReturning) {
+  // The cancellation takes longer than the 3000 ms grace; the operation must
+  // not return (and free its request) while the drive may still write.
+  machine_.SetCancelDelay(kDrive, sim::Endpoint::Disk, 2 * kCancelGraceMs);
+  machine_.HangIo(kDrive, sim::Endpoint::Disk, true);
+  SetEvent(abort_.Get());
+
+  BYTE inquiry[kInquiryLength] = {};
+  EXPECT_EQ(ScsiInquiry(disk_.Get(), inquiry, abort_.Get()), DWORD{ERROR_OPERATION_ABORTED});
+  EXPECT_EQ(machine_.PendingCount(kDrive, sim::Endpoint::Disk), 0u);
+
+  OVERLAPPED overlapped{};
+  overlapped.hEvent = ownEvent_.Get();
+  const BYTE page[5] = {0x81, 0x00, 0x00, 0x01, 0x05};
+  EXPECT_EQ(SendDiagnosticPage(disk_.Get(), page, sizeof(page), &overlapped, abort_.Get()),
+            DWORD{ERROR_IO_PENDING});
+  EXPECT_EQ(GetLastError(), DWORD{ERROR_OPERATION_ABORTED});
+  EXPECT_TRUE(HasOverlappedIoCompleted(&overlapped));
+  EXPECT_EQ(machine_.PendingCount(kDrive, sim::Endpoint::Disk), 0u);
+}
+
+}  // namespace
