@@ -1,19 +1,168 @@
-// Minimal form: no drive is reached yet, so every drive answers as one that
-// gave no answer (status 0, sleep state 3, control write not opened).
+// Status page 0x82, sleep-state page 0x83 and the control block, read and
+// written through diagnostic pages or the equivalent HID reports.
 #include "transport/status_pages.h"
 
 #include <cstring>
 
-DWORD ReadDriveStatus(const DriveRecord*, BYTE* page) {
-  std::memset(page, 0, 8);
-  return 0;
+#include "monitor/monitor_state.h"
+#include "platform/wide.h"
+#include "transport/pass_through.h"
+
+namespace {
+
+constexpr BYTE kStatusPage = 0x82;
+constexpr BYTE kStatusPageLength = 8;
+constexpr BYTE kSleepPage = 0x83;
+constexpr BYTE kSleepPageLength = 5;
+constexpr BYTE kStatusReportId = 2;
+constexpr BYTE kSleepReportId = 3;
+constexpr BYTE kControlReportId = 2;
+constexpr ULONG kInputReportLength = 16;
+constexpr DWORD kFailedReadPauseMs = 200;
+constexpr DWORD kBusUsb = 2;
+constexpr DWORD kNotOpened = 0xFFFFFFFF;
+constexpr std::size_t kPathUnits = 256;
+
+// Status codes by the page's status nibble.
+constexpr DWORD kStatusCodes[16] = {0, 5, 1, 6, 1, 3, 2, 1, 7, 8, 4, 4, 4, 4, 4, 4};
+
+enum class Transport { Diagnostic, Hid };
+
+struct OpenedDrive {
+  HANDLE handle = INVALID_HANDLE_VALUE;
+  Transport transport = Transport::Diagnostic;
+  DWORD error = ERROR_SUCCESS;     // why it did not open
+  bool noStatusInterface = false;  // bound drive that offers neither path
+};
+
+DWORD FailureCode(DWORD error) {
+  return error != ERROR_SUCCESS ? error : ERROR_GEN_FAILURE;
 }
 
-DWORD ReadSleepState(const DriveRecord*, BYTE* page) {
-  std::memset(page, 0, 5);
-  return 3;
+// Opens the drive's control interface, or its HID collection for a USB drive,
+// synchronously. A drive that cannot be opened asks for a rescan, except a
+// drive already bound to its channel that simply has neither interface (an
+// IEEE 1394 drive reached through the button filter driver): a rescan would
+// find it the same way, so asking would only rescan for ever.
+OpenedDrive OpenDrive(const DriveRecord* drive) {
+  OpenedDrive opened;
+  // The record may come from the user-interface application: the path is
+  // copied into a buffer that is terminated whatever the record holds.
+  WCHAR path[kPathUnits + 1] = {};
+  if (drive->controlPath[0] != 0) {
+    std::memcpy(path, drive->controlPath, sizeof(drive->controlPath));
+    opened.transport = Transport::Diagnostic;
+  } else if (drive->busKind == kBusUsb) {
+    std::memcpy(path, drive->hidPath, sizeof(drive->hidPath));
+    opened.transport = Transport::Hid;
+  } else if (drive->channelPath[0] != 0) {
+    opened.noStatusInterface = true;
+    opened.error = ERROR_NOT_SUPPORTED;
+    return opened;
+  } else {
+    opened.error = GetLastError();
+    RequestRefresh();
+    return opened;
+  }
+  opened.handle =
+      CreateFileW(path, GENERIC_READ | GENERIC_WRITE, FILE_SHARE_READ | FILE_SHARE_WRITE, nullptr,
+                  OPEN_EXISTING, 0, nullptr);
+  if (opened.handle == INVALID_HANDLE_VALUE) {
+    opened.error = FailureCode(GetLastError());
+    RequestRefresh();
+  }
+  return opened;
 }
 
-DWORD WriteDriveControl(const DriveRecord*, const BYTE*) {
-  return 0xFFFFFFFF;
+// HidD_GetInputReport, looked up in "hid.dll" at each call. 0 or the error.
+DWORD GetHidInputReport(HANDLE device, BYTE* report, ULONG length) {
+  const HMODULE library = LoadLibraryW(WSTR("hid.dll"));
+  if (library == nullptr) return FailureCode(GetLastError());
+  using GetInputReportFunction = BOOLEAN(WINAPI*)(HANDLE, PVOID, ULONG);
+  const auto function = reinterpret_cast<GetInputReportFunction>(
+      reinterpret_cast<void (*)()>(GetProcAddress(library, "HidD_GetInputReport")));
+  DWORD error = ERROR_SUCCESS;
+  if (function == nullptr) {
+    error = FailureCode(GetLastError());
+  } else if (!function(device, report, length)) {
+    error = FailureCode(GetLastError());
+  }
+  FreeLibrary(library);
+  return error;
+}
+
+// Reads one page, from the diagnostic page or from the HID input report that
+// stands for it. Returns 0 or the error; pauses after a failed read.
+DWORD ReadPage(const DriveRecord* drive, BYTE pageCode, BYTE* page, BYTE pageLength) {
+  OpenedDrive opened = OpenDrive(drive);
+  if (opened.noStatusInterface) return opened.error;
+  DWORD error = opened.error;
+  if (opened.handle != INVALID_HANDLE_VALUE) {
+    if (opened.transport == Transport::Diagnostic) {
+      OVERLAPPED overlapped{};
+      error =
+          ReceiveDiagnosticPage(opened.handle, pageCode, page, pageLength, &overlapped, nullptr);
+    } else {
+      BYTE report[kInputReportLength] = {};
+      report[0] = pageCode == kStatusPage ? kStatusReportId : kSleepReportId;
+      error = GetHidInputReport(opened.handle, report, kInputReportLength);
+      if (error == ERROR_SUCCESS && pageCode == kStatusPage) {
+        page[0] = kStatusPage;
+        page[4] = static_cast<BYTE>(report[4] & 0xCF);
+        page[5] = report[3];
+        page[6] = report[2];
+        page[7] = report[1];
+      } else if (error == ERROR_SUCCESS) {
+        page[0] = kSleepPage;
+        page[4] = static_cast<BYTE>(report[1] << 6);
+      }
+    }
+    CloseHandle(opened.handle);
+  }
+  if (error != ERROR_SUCCESS) Sleep(kFailedReadPauseMs);
+  return error;
+}
+
+}  // namespace
+
+DWORD StatusCodeOfPage(const BYTE* page) {
+  if (page[0] != kStatusPage) return 0;
+  return kStatusCodes[page[4] & 0x0F];
+}
+
+DWORD ReadDriveStatus(const DriveRecord* drive, BYTE* page) {
+  std::memset(page, 0, kStatusPageLength);
+  if (ReadPage(drive, kStatusPage, page, kStatusPageLength) != ERROR_SUCCESS) return 0;
+  return StatusCodeOfPage(page);
+}
+
+DWORD ReadSleepState(const DriveRecord* drive, BYTE* page) {
+  std::memset(page, 0, kSleepPageLength);
+  if (ReadPage(drive, kSleepPage, page, kSleepPageLength) != ERROR_SUCCESS) return 3;
+  switch (page[4] >> 6) {
+    case 2:
+      return 2;
+    case 3:
+      return 3;
+    default:
+      return 0;
+  }
+}
+
+DWORD WriteDriveControl(const DriveRecord* drive, const BYTE* control) {
+  OpenedDrive opened = OpenDrive(drive);
+  if (opened.handle == INVALID_HANDLE_VALUE) return kNotOpened;
+  DWORD result;
+  if (opened.transport == Transport::Diagnostic) {
+    OVERLAPPED overlapped{};
+    result = SendDiagnosticPage(opened.handle, control, kStatusPageLength, &overlapped, nullptr);
+  } else {
+    const BYTE report[5] = {kControlReportId, control[7], control[6], 0x00, control[4]};
+    DWORD written = 0;
+    result = WriteFile(opened.handle, report, sizeof(report), &written, nullptr)
+                 ? ERROR_SUCCESS
+                 : FailureCode(GetLastError());
+  }
+  CloseHandle(opened.handle);
+  return result;
 }

@@ -1,5 +1,7 @@
-// The drive's status page, sleep state and control block. All are called
-// with the state mutex held.
+// The drive's status page, sleep state and control block, through the
+// drive's control interface (diagnostic pages) or its HID collection (input
+// and output reports). All are called with the state mutex held; a drive
+// that cannot be opened asks for a full rescan.
 #pragma once
 
 #include "discovery/drive_record.h"
@@ -11,3 +13,6 @@ DWORD ReadDriveStatus(const DriveRecord* drive, BYTE* page);
 DWORD ReadSleepState(const DriveRecord* drive, BYTE* page);
 // 0 on success, a Win32 error, or 0xFFFFFFFF when the drive did not open.
 DWORD WriteDriveControl(const DriveRecord* drive, const BYTE* control);
+
+// The status code of a status page (0 unless byte 0 is 0x82).
+DWORD StatusCodeOfPage(const BYTE* page);

@@ -1,0 +1,243 @@
+// RunMonitor on a thread of its own with its channel workers, on the embedded
+// default machine and on a machine whose drives are all of channel models.
+// Each case scripts the run from the monitor's pass hook (monitor thread,
+// mutex released) and copies what it checks out of the working block there,
+// since the block is freed when the monitor ends.
+#include <gtest/gtest.h>
+
+#include <condition_variable>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "machine.h"
+#include "monitor/monitor_state.h"
+#include "monitor/state_lock.h"
+#include "platform/wide.h"
+#include "service/process_locks.h"
+#include "service/service_host.h"
+#include "transport/drive_command.h"
+
+namespace {
+
+// A guard against a run that never reaches its goal: 3000 passes of 10 ms.
+constexpr std::size_t kMaxPasses = 3000;
+
+struct Snapshot {
+  PassKind kind = PassKind::Regular;
+  DWORD statusWord = 0;
+  DWORD rescans = 0;
+  LONG driveCount = 0;
+  LONG channelCount = 0;
+  std::vector<LONG> linked;
+  std::vector<DWORD> fromChannel;
+  std::vector<DWORD> pendingAction;
+  std::vector<DWORD> lightMarker;
+};
+
+Snapshot Take(PassKind kind) {
+  Snapshot s;
+  s.kind = kind;
+  StateLock lock;
+  const StateBlock* block = monitorState.stateBlock;
+  s.statusWord = block->statusWord;
+  s.rescans = monitorState.rescanCount;
+  s.driveCount = block->driveCount;
+  s.channelCount = block->channelCount;
+  for (LONG i = 0; i < block->channelCount; ++i) {
+    s.linked.push_back(block->channels[i].linkedDrive);
+    s.pendingAction.push_back(block->channels[i].pendingPanelAction);
+    s.lightMarker.push_back(block->channels[i].lightPulseMarker);
+  }
+  for (LONG i = 0; i < block->driveCount; ++i)
+    s.fromChannel.push_back(block->drives[i].fromChannel);
+  return s;
+}
+
+// The script sees every snapshot so far and returns true to stop the monitor.
+using Script = std::function<bool(const std::vector<Snapshot>&)>;
+Script* activeScript = nullptr;
+std::vector<Snapshot>* activeSnapshots = nullptr;
+
+void AfterPass(PassKind kind) {
+  activeSnapshots->push_back(Take(kind));
+  if ((*activeScript)(*activeSnapshots) || activeSnapshots->size() >= kMaxPasses) StopMonitor();
+}
+
+class WorkersTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    InitializeProcessLocks();
+    debugMode = true;  // no service control manager: status reports are skipped
+  }
+  void TearDown() override {
+    monitorHooks = MonitorHooks{};
+    if (machine_ != nullptr) {
+      machine_->WaitForDeviceEvents();
+      machine_->Uninstall();
+    }
+  }
+  void Install(std::unique_ptr<sim::Machine> machine) {
+    machine_ = std::move(machine);
+    machine_->SetDeviceEventSink([](DWORD, const void*) {});
+    machine_->Install();
+  }
+  // Runs the monitor until the script stops it.
+  void Run(Script script) {
+    activeScript = &script;
+    activeSnapshots = &snapshots_;
+    monitorHooks.afterPass = AfterPass;
+    std::thread monitor([] { RunMonitor(0, nullptr); });
+    monitor.join();
+    monitorHooks = MonitorHooks{};
+    activeScript = nullptr;
+    activeSnapshots = nullptr;
+    ASSERT_LT(snapshots_.size(), kMaxPasses) << "the run did not reach its goal";
+  }
+  // Commands of one control code that the drive received.
+  std::vector<sim::Command> Controls(const std::string& drive, DWORD code) const {
+    std::vector<sim::Command> out;
+    for (const sim::Command& c : machine_->Commands(drive)) {
+      if (c.kind == sim::Command::Kind::Control && c.code == code) out.push_back(c);
+    }
+    return out;
+  }
+
+  std::unique_ptr<sim::Machine> machine_;
+  std::vector<Snapshot> snapshots_;
+};
+
+std::unique_ptr<sim::Machine> DefaultMachine() {
+  std::string error;
+  std::unique_ptr<sim::Machine> machine = sim::LoadMachine(sim::DefaultMachineText(), &error);
+  EXPECT_NE(machine, nullptr) << error;
+  return machine;
+}
+
+TEST_F(WorkersTest, DefaultMachineLinksEveryChannelAndStaysSettled) {
+  Install(DefaultMachine());
+  Run([](const std::vector<Snapshot>& passes) {
+    std::size_t regular = 0;
+    for (const Snapshot& s : passes) regular += s.kind == PassKind::Regular ? 1 : 0;
+    return regular >= 40;
+  });
+  ASSERT_FALSE(snapshots_.empty());
+  for (std::size_t i = 0; i < snapshots_.size(); ++i) {
+    const Snapshot& s = snapshots_[i];
+    SCOPED_TRACE("pass " + std::to_string(i));
+    EXPECT_EQ(s.rescans, 1u) << "a refresh was requested after the first rescan";
+    EXPECT_EQ(s.statusWord, 102u);
+    EXPECT_EQ(s.driveCount, 4) << "no drive record may be made from a channel";
+    ASSERT_EQ(s.channelCount, 4);
+    // gauge HID, plain HID, firewire driver, enclosure: drives 0 to 3.
+    EXPECT_EQ(s.linked, (std::vector<LONG>{0, 1, 2, 3}));
+    EXPECT_EQ(s.fromChannel, (std::vector<DWORD>{0, 0, 0, 0}));
+  }
+  // The start commands each worker gives its channel.
+  EXPECT_EQ(Controls("firewire", CTL_WORKER_START).size(), 1u);
+  EXPECT_EQ(Controls("firewire", CTL_CLEAR_EVENT).size(), 1u);
+  EXPECT_EQ(Controls("firewire", CTL_GET_IDENTITY).size(), 1u);
+  std::size_t serialQueries = 0;
+  for (const sim::Command& c : machine_->Commands()) {
+    serialQueries += c.kind == sim::Command::Kind::HidSerial ? 1 : 0;
+  }
+  EXPECT_EQ(serialQueries, 2u) << "both HID channels read their identity once";
+}
+
+TEST_F(WorkersTest, PanelEventsOnAnUncountedMachineOnlyReportTheUncountedDrive) {
+  // The plain drive is not of a channel model: the counted-drives check
+  // reports it and holds back the panel actions.
+  Install(DefaultMachine());
+  bool pressed = false;
+  Run([&](const std::vector<Snapshot>& passes) {
+    if (!pressed && passes.back().rescans >= 1 &&
+        machine_->PendingCount("firewire", sim::Endpoint::Driver) >= 1) {
+      machine_->Press("firewire", 0x01);
+      pressed = true;
+    }
+    return pressed && passes.back().statusWord == 100;
+  });
+  EXPECT_TRUE(Controls("firewire", CTL_EVENT_REPLY).empty());
+}
+
+std::unique_ptr<sim::Machine> CountedMachine() {
+  // Only drives of channel models: a button-filter-driver drive and an
+  // enclosure, both IEEE 1394.
+  std::string text(sim::DefaultMachineText());
+  const std::size_t gauge = text.find("# USB drive of a standalone gauge model");
+  const std::size_t fireWire = text.find("# IEEE 1394 drive reached through");
+  EXPECT_NE(gauge, std::string::npos);
+  EXPECT_NE(fireWire, std::string::npos);
+  text.erase(gauge, fireWire - gauge);
+  std::string error;
+  std::unique_ptr<sim::Machine> machine = sim::LoadMachine(text, &error);
+  EXPECT_NE(machine, nullptr) << error;
+  return machine;
+}
+
+TEST_F(WorkersTest, PanelEventsOnAControlChannelLightTheDriveAndSetTheAction) {
+  Install(CountedMachine());
+  int step = 0;
+  Run([&](const std::vector<Snapshot>& passes) {
+    const Snapshot& now = passes.back();
+    const bool waiting = machine_->PendingCount("firewire", sim::Endpoint::Driver) >= 1;
+    switch (step) {
+      case 0:  // workers running and waiting
+        if (now.rescans >= 1 && waiting) {
+          machine_->Press("firewire", 0x01);
+          step = 1;
+        }
+        return false;
+      case 1:  // the reply was sent; the marker now holds further replies back
+        if (!Controls("firewire", CTL_EVENT_REPLY).empty() && waiting) {
+          machine_->Press("firewire", 0x01);
+          machine_->Press("firewire", 0x02);
+          step = 2;
+        }
+        return false;
+      default:  // both events handled, in order
+        return now.channelCount >= 1 && now.pendingAction[0] == 5;
+    }
+  });
+  const std::vector<sim::Command> replies = Controls("firewire", CTL_EVENT_REPLY);
+  ASSERT_EQ(replies.size(), 1u);
+  EXPECT_TRUE(replies[0].data.empty()) << "the reply carries no input on a driver channel";
+  const Snapshot& last = snapshots_.back();
+  ASSERT_EQ(last.channelCount, 2);
+  EXPECT_EQ(last.lightMarker[0], 120u);
+  EXPECT_EQ(last.statusWord, 102u);
+  EXPECT_EQ(last.rescans, 1u);
+}
+
+TEST_F(WorkersTest, FailedRemovalIsReportedWithTheDriveIndex) {
+  Install(CountedMachine());
+  machine_->SetEjectVeto("firewire", PNP_VetoOutstandingOpen, "test");
+  machine_->SetEjectVeto("enclosure", PNP_VetoOutstandingOpen, "test");
+  int step = 0;
+  Run([&](const std::vector<Snapshot>& passes) {
+    const Snapshot& now = passes.back();
+    switch (step) {
+      case 0:
+        if (now.rescans >= 1 && machine_->PendingCount("firewire", sim::Endpoint::Driver) >= 1) {
+          machine_->Press("firewire", 0x04);  // control channel, drive 0
+          step = 1;
+        }
+        return false;
+      case 1:
+        if (now.statusWord == 600) {
+          machine_->Press("enclosure", 0x04);  // storage channel, drive 1
+          step = 2;
+        }
+        return false;
+      default:
+        return now.statusWord == 601;
+    }
+  });
+  EXPECT_EQ(step, 2);
+  EXPECT_EQ(snapshots_.back().driveCount, 2) << "the storage worker enumerated again";
+}
+
+}  // namespace
