@@ -1,10 +1,105 @@
-// RefreshChannelGauge and SendDriveGoneFor are complete; the gauge computation
-// and the drive-gone command are in their minimal form and send nothing yet.
+// The drive features the service drives on its own: the capacity gauge and
+// the drive-gone command, both carried by the drive command sender.
 #include "transport/drive_features.h"
 
-#include "monitor/monitor_state.h"
+#include <cstddef>
+#include <cstdint>
 
-void UpdateCapacityGauge(DriveRecord*, ChannelRecord*, HANDLE) {}
+#include "monitor/monitor_state.h"
+#include "platform/wide.h"
+#include "transport/drive_command.h"
+
+namespace {
+
+constexpr int kMebibyteShift = 20;
+constexpr BYTE kDriveGoneHidState = 4;
+constexpr BYTE kDriveGoneDriverState = 1;
+constexpr WORD kDriveGoneGaugeValue = 1;
+constexpr std::size_t kMaxVolumeLetters = 26;
+
+struct VolumeSpace {
+  std::uint64_t totalMiB;
+  std::uint64_t freeMiB;
+};
+
+bool QueryVolumeSpace(const WCHAR* root, VolumeSpace* space) {
+  ULARGE_INTEGER available{};
+  ULARGE_INTEGER total{};
+  ULARGE_INTEGER totalFree{};
+  if (!GetDiskFreeSpaceExW(root, &available, &total, &totalFree)) return false;
+  space->totalMiB = total.QuadPart >> kMebibyteShift;
+  space->freeMiB = totalFree.QuadPart >> kMebibyteShift;
+  return true;
+}
+
+// A reading the gauge can use: some size, and no more free than there is.
+// (64-bit arithmetic, so that very large volumes are not taken for broken
+// ones, and a free count above the total cannot drive the sum past 100 %.)
+bool Usable(const VolumeSpace& space) {
+  return space.totalMiB != 0 && space.freeMiB <= space.totalMiB;
+}
+
+// The drive record in the working array that the channel is linked to.
+DriveRecord* LinkedWorkingDrive(const ChannelRecord* channel) {
+  StateBlock* block = monitorState.stateBlock;
+  if (block == nullptr || channel->linkedDrive < 0 || channel->linkedDrive >= kMaxDrives) {
+    return nullptr;
+  }
+  return &block->drives[channel->linkedDrive];
+}
+
+}  // namespace
+
+DWORD UsedSpacePercent(const DriveRecord* drive) {
+  std::uint64_t freeSum = 0;
+  std::uint64_t totalSum = 0;
+  const std::size_t letters = WideLength(drive->volumeLetters, kMaxVolumeLetters);
+  const std::size_t count = drive->volumeCount < letters ? drive->volumeCount : letters;
+  for (std::size_t i = 0; i < count; ++i) {
+    const WCHAR root[] = {drive->volumeLetters[i], WSTR(':'), WSTR('\\'), 0};
+    VolumeSpace first{};
+    if (!QueryVolumeSpace(root, &first) || !Usable(first)) continue;
+    // The figures summed are those of a second reading.
+    VolumeSpace second{};
+    if (!QueryVolumeSpace(root, &second) || !Usable(second)) continue;
+    freeSum += second.freeMiB;
+    totalSum += second.totalMiB;
+  }
+  if (totalSum == 0) return 0;
+  return static_cast<DWORD>(100 - freeSum * 100 / totalSum);
+}
+
+WORD GaugePattern(DWORD usedPercent, DWORD segments) {
+  if (segments == 0) return 0;
+  const double step = 100.0 / static_cast<double>(segments);
+  const double index = static_cast<double>(usedPercent) / step;
+  constexpr std::size_t kPatternCount = sizeof(kGaugePatterns) / sizeof(kGaugePatterns[0]);
+  // Segment counts other than 4 and 6 could reach past the table: no pattern.
+  if (!(index >= 0.0) || index >= static_cast<double>(kPatternCount)) return 0;
+  return kGaugePatterns[static_cast<std::size_t>(index)];
+}
+
+void UpdateCapacityGauge(DriveRecord* drive, ChannelRecord* channel, HANDLE abortEvent) {
+  if (drive == nullptr || channel == nullptr) return;
+  if (drive->volumeCount == 0 &&
+      (drive->extendedIdentity == 0 || (drive->extendedIdentity == 1 && drive->statusCode == 0))) {
+    // A drive without volumes: the list may be out of date.
+    RequestRefresh();
+  }
+  const DWORD used = UsedSpacePercent(drive);
+  const WORD pattern = GaugePattern(used, drive->gaugeSegments);
+
+  DriveRecord* working = LinkedWorkingDrive(channel);
+  const DWORD workingPercent = working != nullptr ? working->gaugePercent : used;
+  if (used == channel->gaugePercentSent && used == workingPercent) return;
+  channel->gaugePercentSent = used;
+  if (working != nullptr) working->gaugePercent = used;
+
+  if (channel->mode == kChannelModeGauge || channel->mode == kChannelModeEnclosure) {
+    // A failed send is repeated only when the percentage changes again.
+    SendDriveCommand(channel, CTL_SET_GAUGE, pattern, abortEvent);
+  }
+}
 
 void RefreshChannelGauge(int channelIndex, HANDLE abortEvent) {
   StateBlock* block = monitorState.stateBlock;
@@ -17,7 +112,27 @@ void RefreshChannelGauge(int channelIndex, HANDLE abortEvent) {
 
 DWORD SendDriveGone(ChannelRecord* channel) {
   if (channel == nullptr || channel->driveGoneSent != 0) return 0;
-  return 0;
+  channel->driveGoneSent = 1;
+  monitorState.skipTicks = kDriveGoneSkipTicks;
+  if (channel->mode == kChannelModePlain) {
+    const BYTE state =
+        channel->kind == kChannelKindHid ? kDriveGoneHidState : kDriveGoneDriverState;
+    return SendDriveCommand(channel, CTL_SET_STATE, state, nullptr);
+  }
+  const DWORD sent = SendDriveCommand(channel, CTL_SET_GAUGE, kDriveGoneGaugeValue, nullptr);
+  if (sent != 0 && channel->mode == kChannelModeGauge && channel->kind == kChannelKindDriver) {
+    // Closing the shared handle ends the channel's worker.
+    CloseChannelDevice(channel);
+  }
+  return sent;
+}
+
+void CloseChannelDevice(ChannelRecord* channel) {
+  if (channel == nullptr) return;
+  if (channel->deviceHandle != nullptr && channel->deviceHandle != INVALID_HANDLE_VALUE) {
+    CloseHandle(channel->deviceHandle);
+  }
+  channel->deviceHandle = nullptr;
 }
 
 DWORD SendDriveGoneFor(DriveRecord* drive, ChannelRecord* channel) {

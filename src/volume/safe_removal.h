@@ -1,4 +1,5 @@
-// Safe removal and eject of a drive.
+// Safe removal of a drive: volumes offline, device node ejected, drive-gone
+// command, channel unlinked.
 #pragma once
 
 #include "discovery/drive_record.h"

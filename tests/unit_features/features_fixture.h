@@ -1,0 +1,211 @@
+// A machine with a drive of each channel kind and mode, the monitor state a
+// running service has (mutex held by the test thread, working block), the
+// channel records as a rescan builds and binds them, and each channel's
+// shared handle opened as the worker starter opens it.
+#pragma once
+
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "discovery/channel_binding.h"
+#include "discovery/channel_scan.h"
+#include "discovery/drive_enumeration.h"
+#include "machine.h"
+#include "monitor/monitor_state.h"
+#include "platform/wide.h"
+#include "service/process_locks.h"
+#include "transport/button_events.h"
+#include "volume/volume_letters.h"
+
+namespace featuretest {
+
+using Bytes = std::vector<std::uint8_t>;
+using Kind = sim::Command::Kind;
+
+constexpr std::uint64_t kMiB = 1ull << 20;
+
+inline std::string Narrow(const WCHAR* text) {
+  return WideToUtf8(WideView(text, WideLength(text)));
+}
+
+inline sim::VolumeSpec Volume(char letter, std::uint64_t sizeMiB, std::uint64_t freeMiB) {
+  sim::VolumeSpec volume;
+  volume.letter = letter;
+  volume.sizeBytes = sizeMiB * kMiB;
+  volume.freeBytes = freeMiB * kMiB;
+  return volume;
+}
+
+inline sim::DriveSpec UsbHidDrive(const std::string& name, const std::string& model,
+                                  const std::string& serial, std::vector<sim::VolumeSpec> volumes) {
+  sim::DriveSpec spec;
+  spec.name = name;
+  spec.bus = sim::Bus::Usb;
+  spec.channel = sim::ChannelKind::Hid;
+  spec.modelCode = model;
+  spec.serial = serial;
+  spec.volumes = std::move(volumes);
+  return spec;
+}
+
+inline sim::DriveSpec FireWireDrive(const std::string& name, sim::ChannelKind channel,
+                                    const std::string& unitModel, const std::string& unitId,
+                                    std::vector<sim::VolumeSpec> volumes) {
+  sim::DriveSpec spec;
+  spec.name = name;
+  spec.bus = sim::Bus::Ieee1394;
+  spec.channel = channel;
+  spec.modelCode = "5E22";
+  spec.unitModel = unitModel;
+  spec.unitId = unitId;
+  spec.serial = "QX-" + unitId.substr(8);
+  spec.volumes = std::move(volumes);
+  return spec;
+}
+
+class FeatureTest : public ::testing::Test {
+ protected:
+  // Lets a case change a drive before the machine is installed.
+  virtual void Customize(std::vector<sim::DriveSpec>* /*drives*/) {}
+
+  void SetUp() override {
+    InitializeProcessLocks();
+    monitorState = MonitorState{};
+    monitorState.tick = 1;
+    monitorState.osKind = kOsXpOrLater;
+    monitorState.stateMutex = CreateMutexW(nullptr, FALSE, nullptr);
+    monitorState.stopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+    monitorState.workerStopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+    block_.reset(static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock))));
+    monitorState.stateBlock = block_.get();
+    // The callers of every procedure here hold the state mutex.
+    ASSERT_EQ(WaitForSingleObject(monitorState.stateMutex, 0), WAIT_OBJECT_0);
+
+    // gauge: HID of a standalone gauge model (mode 1), two 1000 MiB volumes
+    // with 250 and 750 MiB free; plain: HID of a model outside the channel
+    // list (mode 0); firewire: button filter driver (mode 0); lights: button
+    // filter driver of a unit with lights (mode 1); enclosure: IEEE 1394
+    // enclosure services (mode 2).
+    std::vector<sim::DriveSpec> drives = {
+        UsbHidDrive("gauge", "7B44", "QX-7K2A9F31",
+                    {Volume('E', 1000, 250), Volume('K', 1000, 750)}),
+        UsbHidDrive("plain", "2A31", "QX-5M8B2D07", {Volume('F', 1000, 500)}),
+        FireWireDrive("firewire", sim::ChannelKind::Driver, "EXTERNAL_HDD", "0030E0000001A2B3",
+                      {Volume('H', 1000, 500)}),
+        FireWireDrive("lights", sim::ChannelKind::Driver, "EXTERNAL_LIGHTS", "0030E0000002C4D5",
+                      {Volume('J', 1000, 500)}),
+        FireWireDrive("enclosure", sim::ChannelKind::Enclosure, "QUARRY", "0030E00000045D6F",
+                      {Volume('I', 1000, 500)}),
+    };
+    drives.back().modelCode = "3C13";
+    Customize(&drives);
+    for (const sim::DriveSpec& drive : drives) machine_.AddDrive(drive);
+    machine_.Install();
+
+    EnumerateDrives(nullptr);
+    AssignVolumeLetters();
+    RebuildChannelTable();
+    ASSERT_EQ(Block().channelCount, 5);
+    for (int i = 0; i < Block().channelCount; ++i) {
+      ChannelRecord& channel = Block().channels[i];
+      OpenShared(&channel);
+      // HID channels are matched by the serial string their worker reads.
+      if (channel.kind == kChannelKindHid) {
+        ASSERT_EQ(ReadDriveIdentity(&channel, nullptr, 0), 1u);
+      }
+      ASSERT_GE(BindChannelToDrive(&channel, nullptr, 0), 0) << Narrow(channel.devicePath);
+      ASSERT_GE(channel.linkedDrive, 0);
+    }
+    monitorState.refreshRequests = 0;
+    monitorState.burstRequested = 0;
+    monitorState.gaugePassRequested = 0;
+    monitorState.sleepPassRequested = 0;
+    machine_.ClearCommands();
+  }
+
+  void TearDown() override {
+    for (int i = 0; i < kMaxChannels; ++i) {
+      ChannelRecord& channel = Block().channels[i];
+      if (channel.deviceHandle != nullptr) CloseHandle(channel.deviceHandle);
+      channel.deviceHandle = nullptr;
+    }
+    machine_.WaitForDeviceEvents();
+    machine_.Uninstall();
+    ReleaseMutex(monitorState.stateMutex);
+    CloseHandle(monitorState.workerStopEvent);
+    CloseHandle(monitorState.stopEvent);
+    CloseHandle(monitorState.stateMutex);
+    monitorState = MonitorState{};
+  }
+
+  // Opens the shared handle as the worker starter does.
+  static void OpenShared(ChannelRecord* channel) {
+    const bool readWrite = channel->kind == kChannelKindHid || channel->mode != 0;
+    channel->deviceHandle =
+        CreateFileW(channel->devicePath, readWrite ? GENERIC_READ | GENERIC_WRITE : 0,
+                    readWrite ? FILE_SHARE_READ | FILE_SHARE_WRITE : 0, nullptr, OPEN_EXISTING,
+                    FILE_FLAG_OVERLAPPED, nullptr);
+    ASSERT_NE(channel->deviceHandle, INVALID_HANDLE_VALUE) << Narrow(channel->devicePath);
+  }
+
+  StateBlock& Block() { return *block_; }
+
+  // The channel whose device path contains `part` (lower case).
+  ChannelRecord* Channel(const std::string& part) {
+    for (int i = 0; i < Block().channelCount; ++i) {
+      if (Narrow(Block().channels[i].devicePath).find(part) != std::string::npos) {
+        return &Block().channels[i];
+      }
+    }
+    ADD_FAILURE() << "no channel with " << part;
+    return &Block().channels[kMaxChannels - 1];
+  }
+  ChannelRecord* Gauge() { return Channel("pid_7b44"); }
+  ChannelRecord* Plain() { return Channel("pid_2a31"); }
+  ChannelRecord* FireWire() { return Channel("external_hdd#"); }
+  ChannelRecord* Lights() { return Channel("external_lights#"); }
+  ChannelRecord* Enclosure() { return Channel("_ses"); }
+
+  // The working drive record the channel is linked to, and a private copy.
+  DriveRecord& Working(const ChannelRecord* channel) {
+    return Block().drives[channel->linkedDrive];
+  }
+  DriveRecord CopyOf(const ChannelRecord* channel) { return Working(channel); }
+
+  // What the drive received of one kind, in order.
+  std::vector<sim::Command> Sent(const std::string& drive, Kind kind) {
+    std::vector<sim::Command> out;
+    for (const sim::Command& command : machine_.Commands(drive)) {
+      if (command.kind == kind) out.push_back(command);
+    }
+    return out;
+  }
+  // Value bytes of the HID output reports written (report ID stripped).
+  std::vector<Bytes> HidValues(const std::string& drive) {
+    std::vector<Bytes> out;
+    for (const sim::Command& c : Sent(drive, Kind::HidOutput)) {
+      out.push_back(Bytes(c.data.begin() + 1, c.data.begin() + 3));
+    }
+    return out;
+  }
+  // SEND DIAGNOSTIC pages (page code and parameter byte) an enclosure got.
+  std::vector<Bytes> EnclosurePages(const std::string& drive) {
+    std::vector<Bytes> out;
+    for (const sim::Command& c : Sent(drive, Kind::Scsi)) {
+      if (c.code == 0x1D && c.data.size() >= 5) out.push_back(Bytes{c.data[0], c.data[4]});
+    }
+    return out;
+  }
+
+  struct FreeBlock {
+    void operator()(StateBlock* block) const { std::free(block); }
+  };
+  std::unique_ptr<StateBlock, FreeBlock> block_;
+  sim::Machine machine_;
+};
+
+}  // namespace featuretest

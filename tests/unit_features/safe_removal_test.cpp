@@ -1,0 +1,227 @@
+// Safe removal: volumes offline, the device node ejected (retried while
+// vetoed), the drive-gone command and the channel unlinked; and the paths on
+// which nothing is ejected.
+#include "volume/safe_removal.h"
+
+#include "features_fixture.h"
+#include "transport/drive_command.h"
+#include "transport/drive_features.h"
+#include "volume/eject.h"
+
+namespace featuretest {
+namespace {
+
+bool NamesFunctionNode(const sim::Machine::EjectRequest& request) {
+  return request.instanceId.find("&MI_00\\") != std::string::npos;
+}
+
+class SafeRemovalTest : public FeatureTest {
+ protected:
+  int Remove(ChannelRecord* channel) {
+    DriveRecord copy = CopyOf(channel);
+    return SafeRemoveDrive(&copy, channel);
+  }
+  // The removal left the drive and its channel as they were.
+  void ExpectNotRemoved(const std::string& drive, const ChannelRecord* channel, LONG linked) {
+    EXPECT_TRUE(machine_.Attached(drive));
+    EXPECT_EQ(channel->linkedDrive, linked);
+    EXPECT_EQ(channel->driveGoneSent, 0u);
+  }
+};
+
+TEST_F(SafeRemovalTest, RemovesTheDriveAndUnlinksItsChannel) {
+  ChannelRecord* gauge = Gauge();
+  ASSERT_EQ(Remove(gauge), 1);
+  EXPECT_EQ(machine_.DismountCount('E'), 1);
+  EXPECT_EQ(machine_.DismountCount('K'), 1);
+  const auto ejects = machine_.Ejects();
+  ASSERT_EQ(ejects.size(), 1u);
+  EXPECT_FALSE(ejects[0].queryAndRemove) << "the parent may be surprise-removed: eject request";
+  EXPECT_TRUE(NamesFunctionNode(ejects[0])) << ejects[0].instanceId;
+  EXPECT_FALSE(machine_.Attached("gauge"));
+  EXPECT_EQ(gauge->driveGoneSent, 1u);
+  EXPECT_EQ(gauge->linkedDrive, -1);
+  EXPECT_EQ(monitorState.skipTicks, kDriveGoneSkipTicks);
+  EXPECT_TRUE(machine_.Attached("plain"));
+}
+
+TEST_F(SafeRemovalTest, WithoutDrivesTheEjectIsSkipped) {
+  ChannelRecord* plain = Plain();
+  Block().driveCount = 0;
+  ASSERT_EQ(Remove(plain), 1);
+  EXPECT_EQ(machine_.DismountCount('F'), 1);
+  EXPECT_TRUE(machine_.Ejects().empty());
+  EXPECT_TRUE(machine_.Attached("plain"));
+  EXPECT_EQ(HidValues("plain"), (std::vector<Bytes>{{0x04, 0x00}})) << "drive-gone state";
+  EXPECT_EQ(plain->linkedDrive, -1);
+
+  // A USB drive bound to an enclosure-mode channel loses the channel's
+  // handle before its volumes are touched.
+  ChannelRecord* gauge = Gauge();
+  DriveRecord copy = CopyOf(gauge);
+  copy.channelMode = kChannelModeEnclosure;
+  ASSERT_EQ(SafeRemoveDrive(&copy, gauge), 1);
+  EXPECT_EQ(gauge->deviceHandle, nullptr);
+  EXPECT_EQ(machine_.OpenCount("gauge", sim::Endpoint::Hid), 0u);
+}
+
+TEST_F(SafeRemovalTest, HeldVolumeStopsTheRemovalBeforeAnyEject) {
+  ChannelRecord* gauge = Gauge();
+  const LONG linked = gauge->linkedDrive;
+  machine_.SetVolumeHeldOpen('K', true);
+  EXPECT_EQ(Remove(gauge), 0);
+  EXPECT_EQ(machine_.DismountCount('E'), 1) << "volumes before the held one stay dismounted";
+  EXPECT_EQ(machine_.DismountCount('K'), 0);
+  EXPECT_TRUE(machine_.Ejects().empty());
+  ExpectNotRemoved("gauge", gauge, linked);
+  EXPECT_TRUE(HidValues("gauge").empty());
+}
+
+TEST_F(SafeRemovalTest, VetoIsRetriedFourTimes) {
+  ChannelRecord* gauge = Gauge();
+  const LONG linked = gauge->linkedDrive;
+  machine_.SetEjectVeto("gauge", PNP_VetoOutstandingOpen, "another program");
+  EXPECT_EQ(Remove(gauge), 0);
+  const auto ejects = machine_.Ejects();
+  // Each attempt: eject request, then query-and-remove narrow and wide.
+  ASSERT_EQ(ejects.size(), 12u);
+  for (std::size_t i = 0; i < ejects.size(); ++i) {
+    EXPECT_TRUE(ejects[i].vetoed);
+    EXPECT_EQ(ejects[i].queryAndRemove, i % 3 != 0) << i;
+  }
+  ExpectNotRemoved("gauge", gauge, linked);
+  EXPECT_NE(gauge->deviceHandle, nullptr);
+}
+
+TEST_F(SafeRemovalTest, VetoThatEndsLetsALaterAttemptSucceed) {
+  ChannelRecord* gauge = Gauge();
+  machine_.SetEjectVeto("gauge", PNP_VetoOutstandingOpen, "another program", 3);
+  EXPECT_EQ(Remove(gauge), 1);
+  EXPECT_EQ(machine_.Ejects().size(), 4u);
+  EXPECT_FALSE(machine_.Attached("gauge"));
+
+  // One veto: the query-and-remove after the refused request succeeds.
+  ChannelRecord* plain = Plain();
+  machine_.SetEjectVeto("plain", PNP_VetoWindowsApp, "explorer", 1);
+  EXPECT_EQ(Remove(plain), 1);
+  const auto ejects = machine_.Ejects();
+  ASSERT_EQ(ejects.size(), 6u);
+  EXPECT_TRUE(ejects[5].queryAndRemove);
+  EXPECT_FALSE(ejects[5].vetoed);
+}
+
+TEST_F(SafeRemovalTest, NodeWithoutSurpriseRemovalIsOnlyQueriedAndRemoved) {
+  ChannelRecord* firewire = FireWire();  // IEEE 1394 unit: capabilities 0x04
+  machine_.SetEjectVeto("firewire", PNP_VetoDriver, "sbp2port", 2);
+  EXPECT_EQ(Remove(firewire), 1);
+  const auto ejects = machine_.Ejects();
+  ASSERT_EQ(ejects.size(), 3u);
+  for (const auto& request : ejects) EXPECT_TRUE(request.queryAndRemove);
+  EXPECT_FALSE(machine_.Attached("firewire"));
+  EXPECT_EQ(firewire->linkedDrive, -1);
+}
+
+TEST_F(SafeRemovalTest, LibraryAndFunctionsAreFoundAtRunTime) {
+  ChannelRecord* gauge = Gauge();
+  const LONG linked = gauge->linkedDrive;
+  machine_.SetModuleLoadFails("setupapi.dll", true);
+  EXPECT_EQ(Remove(gauge), 0);
+  EXPECT_TRUE(machine_.Ejects().empty());
+  ExpectNotRemoved("gauge", gauge, linked);
+
+  // A missing function counts as a failed call: the next one is tried.
+  machine_.SetModuleLoadFails("setupapi.dll", false);
+  machine_.RemoveExport("setupapi.dll", "CM_Request_Device_EjectA");
+  machine_.RemoveExport("setupapi.dll", "CM_Query_And_Remove_SubTreeA");
+  machine_.SetEjectVeto("gauge", PNP_VetoOutstandingOpen, "another program", 1);
+  EXPECT_EQ(Remove(gauge), 1);
+  const auto ejects = machine_.Ejects();
+  ASSERT_EQ(ejects.size(), 2u) << "only the wide query-and-remove, in two attempts";
+  EXPECT_TRUE(ejects[0].queryAndRemove);
+  EXPECT_TRUE(ejects[1].queryAndRemove);
+
+  machine_.RemoveExport("setupapi.dll", "CM_Query_And_Remove_SubTreeW");
+  ChannelRecord* plain = Plain();
+  EXPECT_EQ(Remove(plain), 0);
+  EXPECT_EQ(machine_.Ejects().size(), 2u);
+  EXPECT_TRUE(machine_.Attached("plain"));
+}
+
+TEST_F(SafeRemovalTest, UnknownNodeIsNotEjected) {
+  ChannelRecord* gauge = Gauge();
+  DriveRecord copy = CopyOf(gauge);
+  WideCopy(copy.parentDeviceId, 256, WSTR("USB\\VID_0000&PID_0000\\NOWHERE"));
+  EXPECT_EQ(EjectDriveDevice(&copy, gauge), 0);
+  EXPECT_EQ(SafeRemoveDrive(&copy, gauge), 0);
+  EXPECT_TRUE(machine_.Ejects().empty());
+  EXPECT_TRUE(machine_.Attached("gauge"));
+}
+
+// Windows 2000: the two listed models are told of the eject and their USB
+// parent is ejected instead of the storage function.
+class Windows2000RemovalTest : public SafeRemovalTest {
+ protected:
+  void SetUp() override {
+    SafeRemovalTest::SetUp();
+    monitorState.osKind = kOsWindows2000;
+  }
+};
+
+TEST_F(Windows2000RemovalTest, ListedModelIsEjectedThroughItsParent) {
+  ChannelRecord* plain = Plain();  // model 2A31
+  ASSERT_EQ(Remove(plain), 1);
+  EXPECT_EQ(HidValues("plain").at(0), (Bytes{0x20, 0x00})) << "eject notice first";
+  const auto ejects = machine_.Ejects();
+  ASSERT_EQ(ejects.size(), 1u);
+  EXPECT_EQ(ejects[0].instanceId.find("USB\\VID_1A2B&PID_2A31\\"), 0u) << ejects[0].instanceId;
+  EXPECT_FALSE(NamesFunctionNode(ejects[0]));
+  EXPECT_EQ(plain->deviceHandle, nullptr) << "the device is gone; its handle stays closed";
+  EXPECT_EQ(plain->linkedDrive, -1);
+
+  // Other models: the storage function, no notice.
+  ChannelRecord* gauge = Gauge();
+  ASSERT_EQ(Remove(gauge), 1);
+  ASSERT_EQ(machine_.Ejects().size(), 2u);
+  EXPECT_TRUE(NamesFunctionNode(machine_.Ejects()[1]));
+}
+
+TEST_F(Windows2000RemovalTest, FailedParentEjectReopensTheChannel) {
+  ChannelRecord* plain = Plain();
+  const LONG linked = plain->linkedDrive;
+  machine_.SetEjectVeto("plain", PNP_VetoOutstandingOpen, "another program");
+  EXPECT_EQ(Remove(plain), 0);
+  EXPECT_EQ(machine_.Ejects().size(), 12u);
+  ExpectNotRemoved("plain", plain, linked);
+  ASSERT_NE(plain->deviceHandle, nullptr);
+  EXPECT_EQ(machine_.OpenCount("plain", sim::Endpoint::Hid), 1u);
+  // The reopened handle works.
+  EXPECT_EQ(SendDriveCommand(plain, CTL_SET_STATE, 2, nullptr), 1u);
+
+  // Same when the library cannot be loaded.
+  machine_.SetModuleLoadFails("setupapi.dll", true);
+  EXPECT_EQ(Remove(plain), 0);
+  EXPECT_NE(plain->deviceHandle, nullptr);
+  EXPECT_EQ(machine_.OpenCount("plain", sim::Endpoint::Hid), 1u);
+}
+
+// The listed model served by the maker's own driver service, with a parent
+// that cannot be surprise-removed.
+class OwnDriverRemovalTest : public Windows2000RemovalTest {
+  void Customize(std::vector<sim::DriveSpec>* drives) override {
+    (*drives)[1].parentService = "VEVUV_UR";
+    (*drives)[1].parentCapabilities = 0x04;
+  }
+};
+
+TEST_F(OwnDriverRemovalTest, StorageFunctionIsEjectedWithoutNotice) {
+  ChannelRecord* plain = Plain();
+  ASSERT_EQ(Remove(plain), 1);
+  const auto ejects = machine_.Ejects();
+  ASSERT_EQ(ejects.size(), 1u);
+  EXPECT_TRUE(NamesFunctionNode(ejects[0]));
+  EXPECT_TRUE(ejects[0].queryAndRemove) << "capabilities come from the USB parent";
+  for (const Bytes& value : HidValues("plain")) EXPECT_NE(value[0], 0x20);
+}
+
+}  // namespace
+}  // namespace featuretest
