@@ -1,0 +1,125 @@
+#include "pipe/dispatcher.h"
+
+#include <algorithm>
+#include <cstdint>
+#include <cstring>
+
+#include "monitor/monitor_state.h"
+#include "pipe/command_message.h"
+#include "pipe/drive_requests.h"
+#include "pipe/registry_access.h"
+
+namespace {
+
+struct Outcome {
+  DWORD result;
+  DWORD detail;
+};
+
+template <typename T>
+T ReadField(const BYTE* message, std::size_t offset) {
+  T value;
+  std::memcpy(&value, message + offset, sizeof(value));
+  return value;
+}
+
+template <typename T>
+void WriteField(BYTE* message, std::size_t offset, T value) {
+  std::memcpy(message + offset, &value, sizeof(value));
+}
+
+// Command 13: the registry request inside the bytes this request delivered.
+Outcome RunRegistryCommand(BYTE* message, std::size_t delivered) {
+  const std::size_t available =
+      delivered > kRegistryRequestOffset ? delivered - kRegistryRequestOffset : 0;
+  Outcome outcome;
+  outcome.result = RunRegistryRequest(message + kRegistryRequestOffset, available);
+  outcome.detail =
+      ReadField<DWORD>(message, kRegistryRequestOffset + offsetof(RegistryRequest, dataLength));
+  return outcome;
+}
+
+// Carries out one command; the state mutex is held (command 6 lets it go
+// while it runs).
+Outcome RunCommand(BYTE* message, std::size_t delivered) {
+  const DWORD command = ReadField<DWORD>(message, offsetof(CommandMessage, command));
+  const DWORD arg1 = ReadField<DWORD>(message, offsetof(CommandMessage, arg1));
+  const DWORD arg2 = ReadField<DWORD>(message, offsetof(CommandMessage, arg2));
+  const DWORD arg3 = ReadField<DWORD>(message, offsetof(CommandMessage, arg3));
+  StateBlock* block = monitorState.stateBlock;
+  Outcome outcome{0, 0};
+  switch (command) {
+    case kCommandSafeRemove:
+      outcome.result = SafeRemoveRequest(arg1, &outcome.detail);
+      break;
+    case kCommandReleaseDrive:
+    case kCommandReleaseDriveAlso:
+      outcome.result = ReleaseDriveRequest(arg1, &outcome.detail);
+      break;
+    case kCommandForwardMessage:
+      ReleaseMutex(monitorState.stateMutex);
+      ForwardMessageRequest(arg1, arg2, arg3, message + offsetof(CommandMessage, resultSlot));
+      WaitForSingleObject(monitorState.stateMutex, INFINITE);
+      break;
+    case kCommandPause:
+      monitorState.paused = 1;
+      monitorState.pauseTicks = 0;
+      break;
+    case kCommandResume:
+      monitorState.paused = 0;
+      break;
+    case kCommandRefreshGauges:
+      outcome.result = RefreshGaugesRequest(arg1, arg2);
+      break;
+    case kCommandSetStatus:
+      block->statusWord = arg1;
+      monitorState.publishNeeded = 1;
+      outcome.result = 1;
+      break;
+    case kCommandReadStatus:
+      outcome.result = ReadStatusRequest(message + offsetof(CommandMessage, driveImage),
+                                         message + offsetof(CommandMessage, statusBlock));
+      break;
+    case kCommandWriteControl:
+      outcome.result = WriteControlRequest(message + offsetof(CommandMessage, driveImage),
+                                           message + offsetof(CommandMessage, controlBlock));
+      break;
+    case kCommandRegistry:
+      outcome = RunRegistryCommand(message, delivered);
+      break;
+    default:
+      outcome.result = kCommandUnknownResult;
+      outcome.detail = kCommandUnknownResult;
+      break;
+  }
+  return outcome;
+}
+
+}  // namespace
+
+DWORD DispatchRequest(BYTE* request, DWORD received, BYTE* reply) {
+  received = std::min(received, kPipeReadSize);
+  // The buffer is reused from one request to the next: nothing of an earlier
+  // request may show through in this one's reply.
+  std::memset(request + received, 0, kPipeBufferBytes - received);
+
+  const std::uint64_t length = ReadField<std::uint64_t>(request, offsetof(CommandMessage, length));
+  Outcome outcome{0, 0};
+  DWORD replyLength = 0;
+  if (length >= kCommandMinLength && length <= kCommandMaxLength) {
+    replyLength = static_cast<DWORD>(length);
+    WaitForSingleObject(monitorState.stateMutex, INFINITE);
+    outcome = RunCommand(request, std::min<std::size_t>(received, replyLength));
+    ReleaseMutex(monitorState.stateMutex);
+    // The shared block shows the request's effect before the reply leaves.
+    PublishStateBlock(monitorState.fileMapping, true);
+  }
+  WriteField<DWORD>(request, offsetof(CommandMessage, result), outcome.result);
+  WriteField<DWORD>(request, offsetof(CommandMessage, detail), outcome.detail);
+  std::memcpy(reply, request, replyLength);
+  return replyLength;
+}
+
+void DispatchCommand(PipeInstance* instance) {
+  instance->replyLength = DispatchRequest(instance->request, instance->bytesRead, instance->reply);
+}

@@ -1,0 +1,125 @@
+#include "pipe_fixture.h"
+
+#include <chrono>
+#include <cstring>
+
+#include "pipe/pipe_server.h"
+
+namespace pipetest {
+
+void MonitorFixture::SetUp() {
+  monitorState = MonitorState{};
+  block_ = std::make_unique<StateBlock>();
+  std::memset(static_cast<void*>(block_.get()), 0, sizeof(StateBlock));
+  monitorState.stateBlock = block_.get();
+  monitorState.stateMutex = CreateMutexW(nullptr, FALSE, nullptr);
+  monitorState.fileMapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0,
+                                                kStateBlockSize, nullptr);
+  monitorState.pipeStopEvent = CreateEventW(nullptr, FALSE, FALSE, nullptr);
+  ASSERT_NE(monitorState.stateMutex, nullptr);
+  ASSERT_NE(monitorState.fileMapping, nullptr);
+  ASSERT_NE(monitorState.pipeStopEvent, nullptr);
+}
+
+void MonitorFixture::TearDown() {
+  for (HANDLE* handle :
+       {&monitorState.stateMutex, &monitorState.fileMapping, &monitorState.pipeStopEvent}) {
+    if (*handle != nullptr) CloseHandle(*handle);
+    *handle = nullptr;
+  }
+  monitorState.stateBlock = nullptr;
+  block_.reset();
+}
+
+std::unique_ptr<StateBlock> MonitorFixture::Published() {
+  auto copy = std::make_unique<StateBlock>();
+  void* view = MapViewOfFile(monitorState.fileMapping, FILE_MAP_READ, 0, 0, kStateBlockSize);
+  EXPECT_NE(view, nullptr);
+  if (view != nullptr) {
+    WaitForSingleObject(monitorState.stateMutex, INFINITE);
+    std::memcpy(static_cast<void*>(copy.get()), view, kStateBlockSize);
+    ReleaseMutex(monitorState.stateMutex);
+    UnmapViewOfFile(view);
+  }
+  return copy;
+}
+
+void ServerFixture::SetUp() {
+  MonitorFixture::SetUp();
+  if (HasFatalFailure()) return;
+  thread_.Reset(CreateThread(nullptr, 0, PipeServerThread, nullptr, 0, nullptr));
+  ASSERT_TRUE(thread_.Valid());
+}
+
+void ServerFixture::TearDown() {
+  if (thread_.Valid()) {
+    EXPECT_TRUE(StopServer());
+  }
+  MonitorFixture::TearDown();
+}
+
+bool ServerFixture::StopServer() {
+  if (!thread_.Valid()) return false;
+  SetEvent(monitorState.pipeStopEvent);
+  const bool ended = WaitForSingleObject(thread_.Get(), kGuardMs) == WAIT_OBJECT_0;
+  DWORD code = 1;
+  const bool zero = ended && GetExitCodeThread(thread_.Get(), &code) && code == 0;
+  if (ended) thread_.Reset();
+  return zero;
+}
+
+Handle ServerFixture::Connect() {
+  // Until the thread has created the first instance the name does not exist;
+  // after that a busy pipe is waited for by OpenCommandPipe itself.
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(kGuardMs);
+  for (;;) {
+    HANDLE pipe = OpenCommandPipe(kGuardMs);
+    if (pipe != INVALID_HANDLE_VALUE) return Handle(pipe);
+    const DWORD error = GetLastError();
+    if (error != ERROR_FILE_NOT_FOUND || std::chrono::steady_clock::now() > deadline) {
+      ADD_FAILURE() << "cannot open the command pipe, error " << error;
+      return Handle();
+    }
+    Sleep(5);
+  }
+}
+
+DWORD Exchange::Result() const {
+  DWORD value = 0;
+  if (reply.size() >= offsetof(CommandMessage, result) + sizeof(DWORD)) {
+    std::memcpy(&value, reply.data() + offsetof(CommandMessage, result), sizeof(value));
+  }
+  return value;
+}
+
+DWORD Exchange::Detail() const {
+  DWORD value = 0;
+  if (reply.size() >= offsetof(CommandMessage, detail) + sizeof(DWORD)) {
+    std::memcpy(&value, reply.data() + offsetof(CommandMessage, detail), sizeof(value));
+  }
+  return value;
+}
+
+Exchange Send(HANDLE client, const void* request, DWORD sent) {
+  Exchange exchange;
+  std::vector<BYTE> buffer(2 * kCommandMaxLength);
+  DWORD received = 0;
+  exchange.ok = ExchangeCommand(client, request, sent, buffer.data(),
+                                static_cast<DWORD>(buffer.size()), &received);
+  if (!exchange.ok) exchange.error = GetLastError();
+  buffer.resize(received);
+  exchange.reply = std::move(buffer);
+  return exchange;
+}
+
+Exchange Send(HANDLE client, const CommandMessage& message) {
+  return Send(client, &message, sizeof(message));
+}
+
+std::unique_ptr<CommandMessage> NewCommand(DWORD command, DWORD arg1, DWORD arg2, DWORD arg3) {
+  auto message = std::make_unique<CommandMessage>();
+  InitCommand(message.get(), command, arg1, arg2, arg3);
+  return message;
+}
+
+}  // namespace pipetest

@@ -1,0 +1,69 @@
+// The command channel's surroundings as the monitor sets them up: a zeroed
+// state block, its mutex and mapping, and the pipe stop event; optionally the
+// pipe server thread itself. Plus client helpers for the tests.
+#pragma once
+
+#include <gtest/gtest.h>
+
+#include <cstdint>
+#include <memory>
+#include <vector>
+
+#include "monitor/monitor_state.h"
+#include "pipe/command_message.h"
+#include "pipe/pipe_client.h"
+#include "support/test_support.h"
+
+namespace pipetest {
+
+using skytest::Handle;
+using skytest::kGuardMs;
+
+// Monitor state with block, mutex, mapping and stop event (no server thread).
+class MonitorFixture : public ::testing::Test {
+ protected:
+  void SetUp() override;
+  void TearDown() override;
+
+  StateBlock& Block() { return *block_; }
+  // A copy of the block as last published into the mapping.
+  std::unique_ptr<StateBlock> Published();
+
+ private:
+  std::unique_ptr<StateBlock> block_;
+};
+
+// The same with the pipe server thread running.
+class ServerFixture : public MonitorFixture {
+ protected:
+  void SetUp() override;
+  void TearDown() override;
+
+  // Signals the stop event and waits for the thread; true when it ended with
+  // exit code 0.
+  bool StopServer();
+  // A connected client; waits for the server to listen (guarded).
+  Handle Connect();
+
+ private:
+  Handle thread_;
+};
+
+// One exchange on a connected client. `sent` bytes of `request` go out as one
+// message; the reply (possibly empty) comes back. ok is false when the write
+// or the read failed (error then holds the last error).
+struct Exchange {
+  bool ok = false;
+  DWORD error = 0;
+  std::vector<BYTE> reply;
+  DWORD Result() const;
+  DWORD Detail() const;
+};
+Exchange Send(HANDLE client, const void* request, DWORD sent);
+Exchange Send(HANDLE client, const CommandMessage& message);
+
+// A fresh full-length request on the heap.
+std::unique_ptr<CommandMessage> NewCommand(DWORD command, DWORD arg1 = 0, DWORD arg2 = 0,
+                                           DWORD arg3 = 0);
+
+}  // namespace pipetest

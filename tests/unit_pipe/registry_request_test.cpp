@@ -1,0 +1,305 @@
+// Registry access of command 13: the outcomes the registry gives, and the
+// refusals that keep a client's offsets, lengths and root key from reaching
+// beyond what it sent or into the service's own handles.
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "pipe/command_message.h"
+#include "pipe/dispatcher.h"
+#include "pipe/pipe_client.h"
+#include "pipe/registry_access.h"
+#include "pipe_fixture.h"
+#include "platform/wide.h"
+#include "support/test_support.h"
+
+namespace {
+
+using pipetest::NewCommand;
+
+// A key of this case's own below HKEY_CURRENT_USER\Software, removed at the end.
+class RegistryRequestTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    path_ = Utf8ToWide("Software\\" + skytest::UniqueStem("reg"));
+    HKEY key = nullptr;
+    ASSERT_EQ(RegCreateKeyExW(HKEY_CURRENT_USER, path_.c_str(), 0, nullptr, 0, KEY_ALL_ACCESS,
+                              nullptr, &key, nullptr),
+              ERROR_SUCCESS);
+    RegCloseKey(key);
+  }
+  void TearDown() override { RegDeleteKeyW(HKEY_CURRENT_USER, path_.c_str()); }
+
+  // A full-length command 13 message for this case's key.
+  std::unique_ptr<CommandMessage> Request(const char* name, DWORD operation, DWORD type,
+                                          const void* data, DWORD dataLength) {
+    auto message = NewCommand(kCommandRegistry);
+    const WideString wideName = Utf8ToWide(name);
+    EXPECT_TRUE(LayOutRegistryRequest(message.get(), RootKeyValue(HKEY_CURRENT_USER), path_.c_str(),
+                                      wideName.c_str(), operation, type, data, dataLength));
+    return message;
+  }
+
+  // Runs the request with `available` bytes delivered from the request's start
+  // (all of the message by default).
+  static DWORD Run(CommandMessage* message,
+                   std::size_t available = sizeof(CommandMessage) - kRegistryRequestOffset) {
+    return RunRegistryRequest(reinterpret_cast<BYTE*>(&message->registry), available);
+  }
+
+  // The value's data as the registry holds it, or nothing when it is absent.
+  bool ReadValue(const char* name, DWORD* type, std::vector<BYTE>* data) {
+    HKEY key = nullptr;
+    if (RegOpenKeyExW(HKEY_CURRENT_USER, path_.c_str(), 0, KEY_READ, &key) != ERROR_SUCCESS) {
+      return false;
+    }
+    data->assign(2048, 0);
+    DWORD size = static_cast<DWORD>(data->size());
+    const WideString wideName = Utf8ToWide(name);
+    const LSTATUS status =
+        RegQueryValueExW(key, wideName.c_str(), nullptr, type, data->data(), &size);
+    RegCloseKey(key);
+    data->resize(size);
+    return status == ERROR_SUCCESS;
+  }
+
+  void WriteValue(const char* name, DWORD type, const std::vector<BYTE>& data) {
+    HKEY key = nullptr;
+    ASSERT_EQ(RegOpenKeyExW(HKEY_CURRENT_USER, path_.c_str(), 0, KEY_ALL_ACCESS, &key),
+              ERROR_SUCCESS);
+    const WideString wideName = Utf8ToWide(name);
+    EXPECT_EQ(RegSetValueExW(key, wideName.c_str(), 0, type, data.data(),
+                             static_cast<DWORD>(data.size())),
+              ERROR_SUCCESS);
+    RegCloseKey(key);
+  }
+
+  bool ValueExists(const char* name) {
+    DWORD type = 0;
+    std::vector<BYTE> data;
+    return ReadValue(name, &type, &data);
+  }
+
+  WideString path_;
+};
+
+std::vector<BYTE> Pattern(std::size_t size) {
+  std::vector<BYTE> data(size);
+  for (std::size_t i = 0; i < size; ++i) data[i] = static_cast<BYTE>(i * 7 + 1);
+  return data;
+}
+
+TEST_F(RegistryRequestTest, SetThenQueryRoundTrips) {
+  const std::vector<BYTE> data = Pattern(100);
+  auto set = Request("Blob", kRegistrySet, REG_BINARY, data.data(), 100);
+  EXPECT_EQ(Run(set.get()), ERROR_SUCCESS);
+
+  DWORD type = 0;
+  std::vector<BYTE> stored;
+  ASSERT_TRUE(ReadValue("Blob", &type, &stored));
+  EXPECT_EQ(type, static_cast<DWORD>(REG_BINARY));
+  EXPECT_EQ(stored, data);
+
+  auto query = Request("Blob", kRegistryQuery, REG_NONE, nullptr, 400);
+  query->registry.dataLengthHigh = 0xDEADBEEF;
+  EXPECT_EQ(Run(query.get()), ERROR_SUCCESS);
+  EXPECT_EQ(query->registry.dataLength, 100u);
+  EXPECT_EQ(query->registry.dataLengthHigh, 0u);
+  EXPECT_EQ(query->registry.valueType, static_cast<DWORD>(REG_BINARY));
+  EXPECT_EQ(std::memcmp(RegistryData(query.get()), data.data(), 100), 0);
+}
+
+TEST_F(RegistryRequestTest, QueryWithSmallAreaGivesMoreDataAndNeededSize) {
+  WriteValue("Big", REG_BINARY, Pattern(300));
+  auto query = Request("Big", kRegistryQuery, REG_NONE, nullptr, 10);
+  EXPECT_EQ(Run(query.get()), static_cast<DWORD>(ERROR_MORE_DATA));
+  EXPECT_EQ(query->registry.dataLength, 300u);
+}
+
+TEST_F(RegistryRequestTest, MissingKeyOrValueGivesNotFound) {
+  auto query = Request("Absent", kRegistryQuery, REG_NONE, nullptr, 64);
+  EXPECT_EQ(Run(query.get()), static_cast<DWORD>(ERROR_FILE_NOT_FOUND));
+
+  auto missingKey = NewCommand(kCommandRegistry);
+  const WideString path = path_ + Utf8ToWide("\\NoSuchKey");
+  ASSERT_TRUE(LayOutRegistryRequest(missingKey.get(), RootKeyValue(HKEY_CURRENT_USER), path.c_str(),
+                                    WSTR("x"), kRegistryQuery, REG_NONE, nullptr, 64));
+  EXPECT_EQ(Run(missingKey.get()), static_cast<DWORD>(ERROR_FILE_NOT_FOUND));
+  EXPECT_EQ(missingKey->registry.dataLength, 64u);  // the request's own length stays
+}
+
+TEST_F(RegistryRequestTest, OtherOperationOnlyOpensTheKey) {
+  const std::vector<BYTE> data = Pattern(8);
+  auto request = Request("Untouched", 2, REG_BINARY, data.data(), 8);
+  EXPECT_EQ(Run(request.get()), ERROR_SUCCESS);
+  EXPECT_FALSE(ValueExists("Untouched"));
+}
+
+TEST_F(RegistryRequestTest, RootKeyMustBePredefined) {
+  // A key handle that is valid inside this very process must still be refused:
+  // a number from a client never becomes a handle of the service.
+  HKEY own = nullptr;
+  ASSERT_EQ(RegOpenKeyExW(HKEY_CURRENT_USER, WSTR("Software"), 0, KEY_ALL_ACCESS, &own),
+            ERROR_SUCCESS);
+  const std::uint64_t hklm = RootKeyValue(HKEY_LOCAL_MACHINE);
+  const std::uint64_t refused[] = {
+      0,
+      RootKeyValue(own),
+      hklm + 2,            // performance data
+      hklm + 4,            // not a root of this system
+      hklm & 0xFFFFFFFFu,  // the 32-bit value without its sign
+      0xFFFFFFFFFFFFFFFFull,
+  };
+  const std::vector<BYTE> data = Pattern(4);
+  for (std::uint64_t root : refused) {
+    auto request = Request("Refused", kRegistrySet, REG_BINARY, data.data(), 4);
+    request->registry.rootKey = root;
+    // The relative path as if the root were HKEY_CURRENT_USER\Software.
+    EXPECT_EQ(Run(request.get()), static_cast<DWORD>(ERROR_INVALID_PARAMETER)) << std::hex << root;
+  }
+  RegCloseKey(own);
+  EXPECT_FALSE(ValueExists("Refused"));
+
+  for (HKEY root : {HKEY_CLASSES_ROOT, HKEY_CURRENT_USER, HKEY_LOCAL_MACHINE, HKEY_USERS,
+                    HKEY_CURRENT_CONFIG}) {
+    auto request = NewCommand(kCommandRegistry);
+    ASSERT_TRUE(LayOutRegistryRequest(request.get(), RootKeyValue(root), WSTR(""), WSTR(""), 2,
+                                      REG_NONE, nullptr, 0));
+    EXPECT_EQ(Run(request.get()), ERROR_SUCCESS) << RootKeyValue(root);
+  }
+}
+
+// Offsets and lengths against the bytes delivered: each case is laid out in a
+// full message and then cut or pointed past the end.
+TEST_F(RegistryRequestTest, TextsAndDataMustLieInsideTheBytesDelivered) {
+  const std::vector<BYTE> data = Pattern(16);
+  auto base = Request("Edge", kRegistrySet, REG_BINARY, data.data(), 16);
+  const std::size_t full = sizeof(CommandMessage) - kRegistryRequestOffset;
+  const std::size_t pathStart = kRegistryPathOffset;
+  const std::uint64_t nameOffset = base->registry.nameOffset;
+  const std::uint64_t dataOffset = base->registry.dataOffset;
+  const std::size_t dataEnd = pathStart + nameOffset + dataOffset + 16;
+
+  struct Case {
+    const char* what;
+    std::uint64_t nameOffset;
+    std::uint64_t dataOffset;
+    DWORD dataLength;
+    std::size_t available;
+  };
+  const Case refused[] = {
+      {"nothing after the fixed part", nameOffset, dataOffset, 16, pathStart},
+      {"fixed part cut", nameOffset, dataOffset, 16, pathStart - 1},
+      {"path cut before its terminator", nameOffset, dataOffset, 16, pathStart + 4},
+      {"path terminator half delivered", nameOffset, dataOffset, 16, pathStart + nameOffset - 1},
+      {"name cut before its terminator", nameOffset, dataOffset, 16,
+       pathStart + nameOffset + dataOffset - 1},
+      {"data one byte short", nameOffset, dataOffset, 16, dataEnd - 1},
+      {"name offset at the end", full - pathStart, 0, 0, full},
+      {"name offset past the end", full - pathStart + 2, 0, 0, full},
+      {"name offset huge", 0x8000000000000000ull, dataOffset, 16, full},
+      {"name offset wraps", ~0ull - 1, dataOffset, 16, full},
+      {"data offset past the end", nameOffset, full, 0, full},
+      {"data offset wraps", nameOffset, ~0ull - 7, 16, full},
+      {"data length past the end", nameOffset, dataOffset,
+       static_cast<DWORD>(full - pathStart - nameOffset - dataOffset + 1), full},
+      {"data length huge", nameOffset, dataOffset, 0xFFFFFFFFu, full},
+  };
+  for (const Case& c : refused) {
+    auto request = std::make_unique<CommandMessage>(*base);
+    request->registry.nameOffset = c.nameOffset;
+    request->registry.dataOffset = c.dataOffset;
+    request->registry.dataLength = c.dataLength;
+    EXPECT_EQ(Run(request.get(), c.available), static_cast<DWORD>(ERROR_INVALID_PARAMETER))
+        << c.what;
+  }
+  EXPECT_FALSE(ValueExists("Edge"));
+
+  // Exactly enough bytes: the data area ends on the last byte delivered.
+  auto exact = std::make_unique<CommandMessage>(*base);
+  EXPECT_EQ(Run(exact.get(), dataEnd), ERROR_SUCCESS);
+  DWORD type = 0;
+  std::vector<BYTE> stored;
+  ASSERT_TRUE(ReadValue("Edge", &type, &stored));
+  EXPECT_EQ(stored, data);
+}
+
+TEST_F(RegistryRequestTest, DataAreaMayEndOnTheLastByteOfTheMessage) {
+  // Path and name at the start, data area reaching the very end of the message.
+  auto request = Request("Tail", kRegistrySet, REG_BINARY, nullptr, 0);
+  const std::size_t room = sizeof(request->registryText);
+  const std::size_t used =
+      static_cast<std::size_t>(request->registry.nameOffset + request->registry.dataOffset);
+  const std::size_t tail = room - used;
+  std::memset(RegistryData(request.get()), 0x5A, tail);
+  request->registry.dataLength = static_cast<DWORD>(tail);
+  EXPECT_EQ(Run(request.get()), ERROR_SUCCESS);
+  DWORD type = 0;
+  std::vector<BYTE> stored;
+  ASSERT_TRUE(ReadValue("Tail", &type, &stored));
+  EXPECT_EQ(stored, std::vector<BYTE>(tail, 0x5A));
+}
+
+// Through the dispatcher: what counts is what the client delivered and
+// declared, whichever is less.
+class RegistryDispatchTest : public pipetest::MonitorFixture {};
+
+TEST_F(RegistryDispatchTest, BytesNotDeliveredOrBeyondTheDeclaredLengthAreRefused) {
+  const std::string stem = "Software\\" + skytest::UniqueStem("reg");
+  const WideString path = Utf8ToWide(stem);
+  HKEY key = nullptr;
+  ASSERT_EQ(RegCreateKeyExW(HKEY_CURRENT_USER, path.c_str(), 0, nullptr, 0, KEY_ALL_ACCESS, nullptr,
+                            &key, nullptr),
+            ERROR_SUCCESS);
+  RegCloseKey(key);
+
+  const DWORD data = 0x01020304;
+  auto message = NewCommand(kCommandRegistry);
+  ASSERT_TRUE(LayOutRegistryRequest(message.get(), RootKeyValue(HKEY_CURRENT_USER), path.c_str(),
+                                    WSTR("Cut"), kRegistrySet, REG_DWORD, &data, sizeof(data)));
+  const std::size_t dataEnd = static_cast<std::size_t>(RegistryData(message.get()) -
+                                                       reinterpret_cast<BYTE*>(message.get())) +
+                              sizeof(data);
+
+  std::vector<BYTE> request(kPipeBufferBytes);
+  std::vector<BYTE> reply(kPipeBufferBytes);
+  auto dispatch = [&](DWORD received, std::uint64_t declared) {
+    std::memcpy(request.data(), message.get(), sizeof(CommandMessage));
+    std::memcpy(request.data(), &declared, sizeof(declared));
+    const DWORD length = DispatchRequest(request.data(), received, reply.data());
+    EXPECT_EQ(length, declared >= kCommandMinLength && declared <= kCommandMaxLength
+                          ? static_cast<DWORD>(declared)
+                          : 0u);
+    DWORD result = 0;
+    std::memcpy(&result, reply.data() + offsetof(CommandMessage, result), sizeof(result));
+    return result;
+  };
+  // The data's last byte did not arrive, although the message declares it.
+  EXPECT_EQ(dispatch(static_cast<DWORD>(dataEnd - 1), kCommandMaxLength),
+            static_cast<DWORD>(ERROR_INVALID_PARAMETER));
+  // It arrived, but lies beyond the length the message declares.
+  if (dataEnd > kCommandMinLength) {
+    EXPECT_EQ(dispatch(kCommandMaxLength, dataEnd - 1),
+              static_cast<DWORD>(ERROR_INVALID_PARAMETER));
+  }
+  HKEY check = nullptr;
+  ASSERT_EQ(RegOpenKeyExW(HKEY_CURRENT_USER, path.c_str(), 0, KEY_READ, &check), ERROR_SUCCESS);
+  DWORD size = 0;
+  EXPECT_EQ(RegQueryValueExW(check, WSTR("Cut"), nullptr, nullptr, nullptr, &size),
+            static_cast<LSTATUS>(ERROR_FILE_NOT_FOUND));
+  // Delivered and declared: stored.
+  EXPECT_EQ(dispatch(static_cast<DWORD>(dataEnd), kCommandMaxLength), ERROR_SUCCESS);
+  DWORD stored = 0;
+  size = sizeof(stored);
+  EXPECT_EQ(RegQueryValueExW(check, WSTR("Cut"), nullptr, nullptr, reinterpret_cast<BYTE*>(&stored),
+                             &size),
+            ERROR_SUCCESS);
+  EXPECT_EQ(stored, data);
+  RegCloseKey(check);
+  RegDeleteKeyW(HKEY_CURRENT_USER, path.c_str());
+}
+
+}  // namespace
