@@ -23,6 +23,7 @@ inline int RunWithWideArguments(int argc, char** argv, int (*entry)(int, LPWSTR*
   storage.reserve(static_cast<std::size_t>(argc));
   for (int i = 0; i < argc; ++i) storage.push_back(Utf8ToWide(argv[i]));
   std::vector<LPWSTR> vector;
+  vector.reserve(storage.size() + 1);
   for (WideString& text : storage) vector.push_back(text.data());
   vector.push_back(nullptr);
   return entry(argc, vector.data());

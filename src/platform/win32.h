@@ -30,12 +30,14 @@ extern "C" {
 #define WSTR(text) L##text
 
 #else
+// clang-format off
 #include "platform/posix/win32_base.h"
 #include "platform/posix/win32_sync.h"
 #include "platform/posix/win32_io.h"
 #include "platform/posix/win32_registry.h"
 #include "platform/posix/win32_service.h"
 #include "platform/posix/win32_devices.h"
+// clang-format on
 
 // UTF-16 literal: u"..." here, where WCHAR is char16_t.
 #define WSTR(text) u##text

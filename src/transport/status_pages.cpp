@@ -82,9 +82,7 @@ DWORD GetHidInputReport(HANDLE device, BYTE* report, ULONG length) {
   const auto function = reinterpret_cast<GetInputReportFunction>(
       reinterpret_cast<void (*)()>(GetProcAddress(library, "HidD_GetInputReport")));
   DWORD error = ERROR_SUCCESS;
-  if (function == nullptr) {
-    error = FailureCode(GetLastError());
-  } else if (!function(device, report, length)) {
+  if (function == nullptr || !function(device, report, length)) {
     error = FailureCode(GetLastError());
   }
   FreeLibrary(library);

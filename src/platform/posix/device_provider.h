@@ -52,7 +52,9 @@ class DeviceFile {
   // CancelIo was called for a pending request of this file. The default
   // completes it at once with ERROR_OPERATION_ABORTED; a device may complete
   // it later (a device slow to cancel) or not at all.
-  virtual void Cancel(const IoRequestPtr& request) { CompleteIo(request, ERROR_OPERATION_ABORTED, 0); }
+  virtual void Cancel(const IoRequestPtr& request) {
+    CompleteIo(request, ERROR_OPERATION_ABORTED, 0);
+  }
   // The handle was closed (pending requests have been cancelled first).
   virtual void Closed() {}
 };

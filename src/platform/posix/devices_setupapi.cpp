@@ -237,6 +237,7 @@ CONFIGRET CM_Get_Device_IDW(DEVINST devInst, PWCHAR buffer, ULONG bufferLength, 
   // terminator does not fit the text is left unterminated and the result is
   // CR_BUFFER_SMALL.
   if (bufferLength < id.size() + 1) {
+    // NOLINTNEXTLINE(bugprone-not-null-terminated-result): unterminated on purpose
     std::memcpy(buffer, id.data(), std::min<std::size_t>(bufferLength, id.size()) * sizeof(WCHAR));
     return CR_BUFFER_SMALL;
   }

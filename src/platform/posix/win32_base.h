@@ -114,10 +114,15 @@ inline bool operator==(const GUID& a, const GUID& b) {
   }
   return true;
 }
-inline bool operator!=(const GUID& a, const GUID& b) { return !(a == b); }
-inline BOOL IsEqualGUID(const GUID& a, const GUID& b) { return a == b ? TRUE : FALSE; }
+inline bool operator!=(const GUID& a, const GUID& b) {
+  return !(a == b);
+}
+inline BOOL IsEqualGUID(const GUID& a, const GUID& b) {
+  return a == b ? TRUE : FALSE;
+}
 
-#define MAKEWORD(a, b) (static_cast<WORD>((static_cast<BYTE>(a)) | (static_cast<WORD>(static_cast<BYTE>(b)) << 8)))
+#define MAKEWORD(a, b) \
+  (static_cast<WORD>((static_cast<BYTE>(a)) | (static_cast<WORD>(static_cast<BYTE>(b)) << 8)))
 #define LOWORD(l) (static_cast<WORD>(static_cast<DWORD_PTR>(l) & 0xffff))
 #define HIWORD(l) (static_cast<WORD>((static_cast<DWORD_PTR>(l) >> 16) & 0xffff))
 #define LOBYTE(w) (static_cast<BYTE>(static_cast<DWORD_PTR>(w) & 0xff))

@@ -2,8 +2,14 @@
 
 namespace platform {
 
-long LiveHandleCount() { return -1; }
-long LiveThreadCount() { return -1; }
-double TimeScale() { return 1.0; }
+long LiveHandleCount() {
+  return -1;
+}
+long LiveThreadCount() {
+  return -1;
+}
+double TimeScale() {
+  return 1.0;
+}
 
 }  // namespace platform
