@@ -23,9 +23,9 @@ constexpr VerbEntry kVerbs[] = {
 int main(int argc, char** argv) {
   if (argc < 2) {
     std::fprintf(stderr,
-                 "usage: skyvane <verb> [options]\n  status [--json] [--wait-open] [--wait-status "
-                 "N] [--wait-sequence N] [--timeout-ms T]\n");
-    return 2;
+                 "usage: skyvane status [--json] [--wait-open] [--wait-status N] "
+                 "[--wait-sequence N] [--timeout-ms T]\n");
+    return RunPipeVerb(argc, argv);  // adds the pipe verbs' usage lines
   }
   for (const VerbEntry& verb : kVerbs) {
     if (std::strcmp(argv[1], verb.name) == 0) return verb.run(argc, argv);

@@ -40,8 +40,14 @@ char16_t FoldUnit(char16_t c) {
   return (c >= u'A' && c <= u'Z') ? static_cast<char16_t>(c + 32) : c;
 }
 
+// Keys every Windows installation has, so that programs (and the service's
+// registry requests) find the usual places to keep their values.
+const TextView kStandardKeys[] = {u"HKEY_CURRENT_USER\\Software", u"HKEY_LOCAL_MACHINE\\SOFTWARE",
+                                  u"HKEY_LOCAL_MACHINE\\SYSTEM\\CurrentControlSet\\Services"};
+
 void EnsureRoots(Store& store) {
   for (TextView root : kRoots) store.Create(root);
+  for (TextView key : kStandardKeys) store.Create(key);
 }
 
 const char kHex[] = "0123456789ABCDEF";
