@@ -240,4 +240,35 @@ TEST_F(WorkersTest, FailedRemovalIsReportedWithTheDriveIndex) {
   EXPECT_EQ(snapshots_.back().driveCount, 2) << "the storage worker enumerated again";
 }
 
+TEST_F(WorkersTest, EjectButtonRemovesTheDriveAndTheRescanForgetsIt) {
+  // The whole path of a removal request: the control worker dismounts the
+  // drive's volume, the eject succeeds, the drive's channel ends with the
+  // device, and the refresh it asks for rebuilds the block without it.
+  Install(CountedMachine());
+  bool pressed = false;
+  Run([&](const std::vector<Snapshot>& passes) {
+    const Snapshot& now = passes.back();
+    if (!pressed) {
+      if (now.rescans >= 1 && machine_->PendingCount("firewire", sim::Endpoint::Driver) >= 1) {
+        machine_->Press("firewire", 0x04);
+        pressed = true;
+      }
+      return false;
+    }
+    return now.rescans >= 2 && now.statusWord == 102 && now.driveCount == 1;
+  });
+  ASSERT_TRUE(pressed);
+  EXPECT_FALSE(machine_->Attached("firewire"));
+  EXPECT_TRUE(machine_->Attached("enclosure"));
+  EXPECT_EQ(machine_->DismountCount('H'), 1) << "the drive's volume was taken offline first";
+  const std::vector<sim::Machine::EjectRequest> ejects = machine_->Ejects();
+  ASSERT_EQ(ejects.size(), 1u);
+  EXPECT_EQ(ejects[0].drive, "firewire");
+  EXPECT_FALSE(ejects[0].vetoed);
+  for (const Snapshot& s : snapshots_) EXPECT_LT(s.statusWord, 600u) << "no removal failed";
+  const Snapshot& last = snapshots_.back();
+  EXPECT_EQ(last.channelCount, 1);
+  EXPECT_EQ(last.linked, (std::vector<LONG>{0}));
+}
+
 }  // namespace
