@@ -3,30 +3,14 @@
 // leaves with _exit (no gtest in the child).
 #include <gtest/gtest.h>
 #include <signal.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <cstring>
 
+#include "fork_child.h"
 #include "platform/diagnostics.h"
 #include "platform/win32.h"
 
 namespace {
-
-// Runs `body` in a child process; returns its pid. The child's exit code is
-// the body's result.
-template <class Body>
-pid_t Fork(Body body) {
-  pid_t pid = fork();
-  if (pid == 0) _exit(body());
-  return pid;
-}
-
-int ExitCodeOf(pid_t pid) {
-  int status = 0;
-  if (waitpid(pid, &status, 0) != pid) return -1;
-  return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-}
 
 TEST(CrossProcess, NamedEventSetByChildReleasesWaiter) {
   HANDLE ready = CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuXpReady"));

@@ -4,29 +4,15 @@
 // as closed.
 #include <gtest/gtest.h>
 #include <signal.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <cstring>
 
+#include "fork_child.h"
 #include "platform/win32.h"
 
 namespace {
 
 constexpr const char16_t* kPipe = u"\\\\.\\pipe\\EmuCrossProcessPipe";
-
-template <class Body>
-pid_t Fork(Body body) {
-  pid_t pid = fork();
-  if (pid == 0) _exit(body());
-  return pid;
-}
-
-int ExitCodeOf(pid_t pid) {
-  int status = 0;
-  if (waitpid(pid, &status, 0) != pid) return -1;
-  return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-}
 
 HANDLE CreateServer() {
   return CreateNamedPipeW(kPipe, PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,

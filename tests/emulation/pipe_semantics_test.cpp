@@ -173,28 +173,6 @@ TEST(PipeSemantics, WriteWaitsForRoomAndOversizedMessagesAreRefused) {
   for (HANDLE h : {client, server, ov.hEvent, rov.hEvent}) CloseHandle(h);
 }
 
-TEST(PipeSemantics, CancelIoAbortsAPendingPipeRead) {
-  HANDLE server = Server();
-  HANDLE client = Client(FILE_FLAG_OVERLAPPED);
-  OVERLAPPED ov{};
-  ov.hEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
-  char buffer[8];
-  EXPECT_FALSE(ReadFile(client, buffer, sizeof(buffer), nullptr, &ov));
-  ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
-  EXPECT_TRUE(CancelIo(client));
-  DWORD bytes = 0;
-  EXPECT_FALSE(GetOverlappedResult(client, &ov, &bytes, TRUE));
-  EXPECT_EQ(GetLastError(), ERROR_OPERATION_ABORTED);
-  EXPECT_FALSE(CancelIoEx(client, &ov));
-  EXPECT_EQ(GetLastError(), ERROR_NOT_FOUND);
-  // The pipe still works.
-  DWORD written = 0;
-  EXPECT_TRUE(WriteFile(server, "hi", 2, &written, nullptr));
-  EXPECT_TRUE(ReadFile(client, buffer, sizeof(buffer), &bytes, &ov));
-  EXPECT_EQ(bytes, 2u);
-  for (HANDLE h : {client, server, ov.hEvent}) CloseHandle(h);
-}
-
 // The request keeps its event object alive after the caller closed the
 // handle; finishing it then drops the last reference inside the emulation.
 TEST(PipeSemantics, EventClosedWhileAReadPends) {

@@ -36,11 +36,12 @@ struct Overlapped {
   OVERLAPPED record{};
 };
 
-// Sends a pass-through command on `device` and waits for it.
-bool Scsi(HANDLE device, PassThroughRequest* request) {
+// Starts a pass-through command on an overlapped handle; true if it completed
+// at once, false with the last error set otherwise.
+bool StartScsi(HANDLE device, PassThroughRequest* request, Overlapped& ov) {
   DWORD bytes = 0;
   return DeviceIoControl(device, IOCTL_SCSI_PASS_THROUGH_DIRECT, request, sizeof *request, request,
-                         sizeof *request, &bytes, nullptr) != FALSE;
+                         sizeof *request, &bytes, &ov.record) != FALSE;
 }
 
 class DeviceIo : public DefaultMachineTest {
@@ -69,9 +70,7 @@ TEST_F(DeviceIo, InquiryReturnsTheDescribedIdentity) {
   PassThroughRequest request = MakeRequest({0x12, 0, 0, 0, 74, 0}, data, 74);
   Overlapped ov;
   DWORD bytes = 0;
-  BOOL ok = DeviceIoControl(device, IOCTL_SCSI_PASS_THROUGH_DIRECT, &request, 80, &request, 80,
-                            &bytes, &ov.record);
-  if (!ok) {
+  if (!StartScsi(device, &request, ov)) {
     ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
     ASSERT_TRUE(GetOverlappedResult(device, &ov.record, &bytes, TRUE));
   }
@@ -464,8 +463,7 @@ TEST_F(DeviceIo, HungRequestIsCancelledAndASlowCancelStillWritesItsReply) {
   PassThroughRequest request = MakeRequest({0x12, 0, 0, 0, 74, 0}, data, 74);
   Overlapped ov;
   DWORD bytes = 0;
-  ASSERT_FALSE(DeviceIoControl(device, IOCTL_SCSI_PASS_THROUGH_DIRECT, &request, 80, &request, 80,
-                               &bytes, &ov.record));
+  ASSERT_FALSE(StartScsi(device, &request, ov));
   ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
   EXPECT_EQ(WaitForSingleObject(ov.event, 0), WAIT_TIMEOUT);
   ASSERT_TRUE(CancelIo(device));
@@ -477,8 +475,7 @@ TEST_F(DeviceIo, HungRequestIsCancelledAndASlowCancelStillWritesItsReply) {
   // reply still lands in the caller's buffers.
   machine->SetCancelDelay("gauge", sim::Endpoint::Disk, INFINITE);
   Overlapped ov2;
-  ASSERT_FALSE(DeviceIoControl(device, IOCTL_SCSI_PASS_THROUGH_DIRECT, &request, 80, &request, 80,
-                               &bytes, &ov2.record));
+  ASSERT_FALSE(StartScsi(device, &request, ov2));
   ASSERT_TRUE(CancelIo(device));
   EXPECT_EQ(WaitForSingleObject(ov2.event, 0), WAIT_TIMEOUT);
   machine->FinishHeldCancels();
@@ -491,8 +488,7 @@ TEST_F(DeviceIo, HungRequestIsCancelledAndASlowCancelStillWritesItsReply) {
   // A finite delay completes on the machine's own timer.
   machine->SetCancelDelay("gauge", sim::Endpoint::Disk, 20);
   Overlapped ov3;
-  ASSERT_FALSE(DeviceIoControl(device, IOCTL_SCSI_PASS_THROUGH_DIRECT, &request, 80, &request, 80,
-                               &bytes, &ov3.record));
+  ASSERT_FALSE(StartScsi(device, &request, ov3));
   ASSERT_TRUE(CancelIo(device));
   EXPECT_FALSE(GetOverlappedResult(device, &ov3.record, &bytes, TRUE));
   EXPECT_EQ(GetLastError(), ERROR_OPERATION_ABORTED);

@@ -180,16 +180,13 @@ end
   ASSERT_NE(device, INVALID_HANDLE_VALUE);
   std::uint8_t data[74] = {};
   PassThroughRequest r = MakeRequest({0x12, 0, 0, 0, 74, 0}, data, 74);
-  DWORD bytes = 0;
-  ASSERT_TRUE(
-      DeviceIoControl(device, IOCTL_SCSI_PASS_THROUGH_DIRECT, &r, 80, &r, 80, &bytes, nullptr));
+  ASSERT_TRUE(Scsi(device, &r));
   EXPECT_EQ(data[4], 31);
   EXPECT_EQ(r.sptd.DataTransferLength, 36u);
   // Page 0x80 of a serial that is only the prefix is empty.
   std::uint8_t page[20] = {};
   PassThroughRequest v = MakeRequest({0x12, 1, 0x80, 0, 20, 0}, page, 20);
-  ASSERT_TRUE(
-      DeviceIoControl(device, IOCTL_SCSI_PASS_THROUGH_DIRECT, &v, 80, &v, 80, &bytes, nullptr));
+  ASSERT_TRUE(Scsi(device, &v));
   EXPECT_EQ(page[3], 0);
   EXPECT_TRUE(CloseHandle(device));
   GUID hid{};

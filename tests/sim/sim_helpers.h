@@ -45,6 +45,13 @@ inline PassThroughRequest MakeRequest(std::initializer_list<UCHAR> cdb, void* bu
   return r;
 }
 
+// Sends a pass-through command on a synchronous handle.
+inline bool Scsi(HANDLE device, PassThroughRequest* request) {
+  DWORD bytes = 0;
+  return DeviceIoControl(device, IOCTL_SCSI_PASS_THROUGH_DIRECT, request, sizeof *request, request,
+                         sizeof *request, &bytes, nullptr) != FALSE;
+}
+
 struct Found {
   std::string path;
   DEVINST devInst = 0;

@@ -49,21 +49,32 @@ TEST_F(EnumerationTest, OnlyInterfacePathsOfTheMakersDrivesAreExamined) {
   EXPECT_TRUE(machine_.Commands("no-line").empty());
 }
 
-TEST_F(EnumerationTest, AdditionalLengthBelow32SkipsTheDisk) {
-  sim::DriveSpec short31 = UsbDrive("short", "7B44", "3331");
-  short31.additionalLength = 31;
+TEST_F(EnumerationTest, ShortUnopenableOrMuteDisksAreSkipped) {
   sim::DriveSpec enough32 = UsbDrive("enough", "7B44", "3332");
   enough32.additionalLength = 32;
-  machine_.AddDrive(short31);
+  sim::DriveSpec short31 = UsbDrive("short", "7B44", "3331");
+  short31.additionalLength = 31;
+  machine_.AddDrive(UsbDrive("closed", "7B44", "434C"));
+  machine_.AddDrive(UsbDrive("mute", "7B44", "4D55"));
   machine_.AddDrive(enough32);
+  machine_.AddDrive(UsbDrive("nonumber", "7B44", "4E4E"));
+  machine_.AddDrive(short31);
+  machine_.FailOpen("closed", sim::Endpoint::Disk, ERROR_ACCESS_DENIED);
+  machine_.FailIo("mute", sim::Endpoint::Disk, ERROR_NOT_READY, -1, 0x12);
+  machine_.FailIo("nonumber", sim::Endpoint::Disk, ERROR_NOT_READY, -1,
+                  IOCTL_STORAGE_GET_DEVICE_NUMBER);
   Install();
 
   EnumerateDrives(nullptr);
-  ASSERT_EQ(Block().driveCount, 1);
+  ASSERT_EQ(Block().driveCount, 2);
   EXPECT_EQ(N(Drive(0).diskPath), enough32.diskPath);
-  // Nothing of the skipped disk shows in the slot it was read into.
-  EXPECT_EQ(Drive(1).diskPath[0], 0);
-  EXPECT_EQ(Drive(1).busKind, 0u);
+  EXPECT_EQ(machine_.OpenCount("mute", sim::Endpoint::Disk), 0u);  // closed after the failure
+  // A failed device number query keeps the disk, with a number no volume carries.
+  EXPECT_TRUE(WideContains(Drive(1).deviceIdUpper, WSTR("4E4E")));
+  EXPECT_EQ(Drive(1).diskNumber, kUnknownDiskNumber);
+  // Nothing of the short disk shows in the slot it was read into.
+  EXPECT_EQ(Drive(2).diskPath[0], 0);
+  EXPECT_EQ(Drive(2).busKind, 0u);
 }
 
 TEST_F(EnumerationTest, SerialTextOfOnlyThePrefixBecomesNaWithoutAsciiPages) {
@@ -157,32 +168,6 @@ TEST_F(EnumerationTest, SeventyDisksCountSixtyThreeAndKeepTheLastInTheScratchSlo
   }
   EXPECT_TRUE(WideContains(Drive(63).deviceIdUpper, WSTR("53450069")));
   EXPECT_EQ(Drive(63).recordIndex, 63);
-}
-
-TEST_F(EnumerationTest, FailedDeviceNumberQueryGivesANumberNoVolumeCarries) {
-  sim::DriveSpec spec = UsbDrive("nonumber", "7B44", "4E4E");
-  machine_.AddDrive(spec);
-  machine_.FailIo("nonumber", sim::Endpoint::Disk, ERROR_NOT_READY, -1,
-                  IOCTL_STORAGE_GET_DEVICE_NUMBER);
-  Install();
-
-  EnumerateDrives(nullptr);
-  ASSERT_EQ(Block().driveCount, 1);
-  EXPECT_EQ(Drive(0).diskNumber, kUnknownDiskNumber);
-}
-
-TEST_F(EnumerationTest, OpenFailureOrInquiryFailureSkipsTheDisk) {
-  machine_.AddDrive(UsbDrive("closed", "7B44", "434C"));
-  machine_.AddDrive(UsbDrive("mute", "7B44", "4D55"));
-  machine_.AddDrive(UsbDrive("fine", "7B44", "4649"));
-  machine_.FailOpen("closed", sim::Endpoint::Disk, ERROR_ACCESS_DENIED);
-  machine_.FailIo("mute", sim::Endpoint::Disk, ERROR_NOT_READY, -1, 0x12);
-  Install();
-
-  EnumerateDrives(nullptr);
-  ASSERT_EQ(Block().driveCount, 1);
-  EXPECT_TRUE(WideContains(Drive(0).deviceIdUpper, WSTR("4649")));
-  EXPECT_EQ(machine_.OpenCount("mute", sim::Endpoint::Disk), 0u);  // closed after the failure
 }
 
 TEST_F(EnumerationTest, Windows2000FindsTheControlInterfaceBySerialKey) {

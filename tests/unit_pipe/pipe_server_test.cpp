@@ -57,18 +57,25 @@ Exchange SendDeclared(HANDLE client, DWORD command, DWORD arg1, std::uint64_t de
   return Send(client, request.data(), sent);
 }
 
-TEST_F(PipeServerTest, LengthsAtTheBoundsAreHandled) {
+TEST_F(PipeServerTest, SetStatusAtEitherLengthBoundIsPublishedBeforeTheReply) {
   Handle client = Connect();
   ASSERT_TRUE(client);
-  DWORD status = 40;
-  for (DWORD length : {kCommandMinLength, kCommandMaxLength}) {
+  const struct {
+    DWORD length;
+    DWORD status;
+  } cases[] = {{kCommandMinLength, 41},
+               {kCommandMaxLength, 500},
+               {kCommandMinLength, 0},
+               {kCommandMaxLength, 0xFFFFFFFFu}};
+  for (const auto& c : cases) {
+    SCOPED_TRACE(testing::Message() << c.length << " " << c.status);
     const DWORD before = PublishedSequence();
-    Exchange reply = SendDeclared(client.Get(), kCommandSetStatus, ++status, length, length);
+    Exchange reply = SendDeclared(client.Get(), kCommandSetStatus, c.status, c.length, c.length);
     ASSERT_TRUE(reply.ok) << reply.error;
-    EXPECT_EQ(reply.reply.size(), length);
+    EXPECT_EQ(reply.reply.size(), c.length);
     EXPECT_EQ(reply.Result(), 1u);
     EXPECT_EQ(reply.Detail(), 0u);
-    EXPECT_EQ(PublishedStatus(), status);
+    EXPECT_EQ(PublishedStatus(), c.status);
     EXPECT_EQ(PublishedSequence(), before + 1);
   }
 }
@@ -145,7 +152,7 @@ TEST_F(PipeServerTest, ReplyHasTheDeclaredLengthAndNoBytesOfAnEarlierRequest) {
   EXPECT_EQ(nonZero, 0u);
 }
 
-TEST_F(PipeServerTest, SixteenthClientIsBusyUntilAnotherLeaves) {
+TEST_F(PipeServerTest, FifteenInstancesOnlyAndTheSixteenthClientWaitsForALeaver) {
   std::vector<Handle> clients;
   for (int i = 0; i < kPipeInstanceCount; ++i) {
     clients.push_back(Connect());
@@ -157,6 +164,13 @@ TEST_F(PipeServerTest, SixteenthClientIsBusyUntilAnotherLeaves) {
   EXPECT_EQ(extra, INVALID_HANDLE_VALUE);
   EXPECT_EQ(GetLastError(), static_cast<DWORD>(ERROR_PIPE_BUSY));
   if (extra != INVALID_HANDLE_VALUE) CloseHandle(extra);
+  // No room for someone else's instance either, which would receive the
+  // service's clients.
+  HANDLE rogue = CreateNamedPipeW(kPipeName, PIPE_ACCESS_DUPLEX,
+                                  PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT,
+                                  kPipeInstanceCount, 4096, 4096, 0, nullptr);
+  EXPECT_EQ(rogue, INVALID_HANDLE_VALUE);
+  if (rogue != INVALID_HANDLE_VALUE) CloseHandle(rogue);
 
   clients[7].Reset();
   Handle late(OpenCommandPipe(skytest::kGuardMs));
@@ -166,21 +180,6 @@ TEST_F(PipeServerTest, SixteenthClientIsBusyUntilAnotherLeaves) {
     if (i == 7) continue;
     EXPECT_TRUE(Send(clients[i].Get(), *NewCommand(kCommandResume)).ok) << i;
   }
-}
-
-TEST_F(PipeServerTest, NoOtherServerCanAddAnInstance) {
-  // Once the fifteen instances exist, the pipe has no room for an instance of
-  // someone else's, which would receive the service's clients.
-  std::vector<Handle> clients;
-  for (int i = 0; i < kPipeInstanceCount; ++i) {
-    clients.push_back(Connect());
-    ASSERT_TRUE(clients.back());
-  }
-  HANDLE rogue = CreateNamedPipeW(kPipeName, PIPE_ACCESS_DUPLEX,
-                                  PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT,
-                                  kPipeInstanceCount, 4096, 4096, 0, nullptr);
-  EXPECT_EQ(rogue, INVALID_HANDLE_VALUE);
-  if (rogue != INVALID_HANDLE_VALUE) CloseHandle(rogue);
 }
 
 TEST_F(PipeServerTest, ClientThatLeavesBeforeItsReplyDisturbsNoOtherInstance) {
@@ -248,48 +247,28 @@ TEST_F(PipeNameTakenTest, ServerRunsWithoutChannelWhenTheNameIsHeld) {
   EXPECT_EQ(code, 0u);
 }
 
-TEST_F(PipeServerTest, PauseRefusesSafeRemovalUntilResumed) {
+TEST_F(PipeServerTest, PauseSetsTheFlagsAndRefusesSafeRemovalUntilResumed) {
   Handle client = Connect();
   ASSERT_TRUE(client);
+  SetPauseTicks(17);
   Exchange pause = Send(client.Get(), *NewCommand(kCommandPause));
   EXPECT_EQ(pause.Result(), 0u);
   EXPECT_EQ(pause.Detail(), 0u);
+  EXPECT_EQ(Paused(), 1u);
+  EXPECT_EQ(PauseTicks(), 0u);
   Exchange refused = Send(client.Get(), *NewCommand(kCommandSafeRemove, 0));
   EXPECT_EQ(refused.Result(), 0u);
   EXPECT_EQ(refused.Detail(), 1u);
   EXPECT_EQ(PublishedStatus(), 0u);  // nothing was attempted
 
+  SetPauseTicks(9);
   EXPECT_EQ(Send(client.Get(), *NewCommand(kCommandResume)).Result(), 0u);
+  EXPECT_EQ(Paused(), 0u);
+  EXPECT_EQ(PauseTicks(), 9u);  // resume clears only the pause
   // No linked channel: the removal fails, and the status word names index 3.
   Exchange failed = Send(client.Get(), *NewCommand(kCommandSafeRemove, 3));
   EXPECT_EQ(failed.Result(), 0u);
   EXPECT_EQ(PublishedStatus(), 603u);
-}
-
-TEST_F(PipeServerTest, PauseSetsTheMonitorFlagsAndResumeClearsOnlyThePause) {
-  Handle client = Connect();
-  ASSERT_TRUE(client);
-  SetPauseTicks(17);
-  ASSERT_TRUE(Send(client.Get(), *NewCommand(kCommandPause)).ok);
-  EXPECT_EQ(Paused(), 1u);
-  EXPECT_EQ(PauseTicks(), 0u);
-  SetPauseTicks(9);
-  ASSERT_TRUE(Send(client.Get(), *NewCommand(kCommandResume)).ok);
-  EXPECT_EQ(Paused(), 0u);
-  EXPECT_EQ(PauseTicks(), 9u);
-}
-
-TEST_F(PipeServerTest, SetStatusIsPublishedBeforeTheReply) {
-  Handle client = Connect();
-  ASSERT_TRUE(client);
-  for (DWORD value : {500u, 0u, 0xFFFFFFFFu}) {
-    const DWORD before = PublishedSequence();
-    Exchange reply = Send(client.Get(), *NewCommand(kCommandSetStatus, value));
-    EXPECT_EQ(reply.Result(), 1u);
-    EXPECT_EQ(reply.Detail(), 0u);
-    EXPECT_EQ(PublishedStatus(), value);
-    EXPECT_EQ(PublishedSequence(), before + 1);
-  }
 }
 
 TEST_F(PipeServerTest, CodesOutsideTheTableAnswerMinus777AndStillPublish) {
@@ -324,12 +303,8 @@ TEST_F(PipeServerTest, DriveCommandsWithoutDrivesAnswerAsNoDrive) {
 }
 
 TEST_F(PipeServerTest, RegistryThroughThePipeReportsNeededSize) {
-  const WideString path = Utf8ToWide("Software\\" + skytest::UniqueStem("reg"));
-  HKEY key = nullptr;
-  ASSERT_EQ(RegCreateKeyExW(HKEY_CURRENT_USER, path.c_str(), 0, nullptr, 0, KEY_ALL_ACCESS, nullptr,
-                            &key, nullptr),
-            ERROR_SUCCESS);
-  RegCloseKey(key);
+  const pipetest::TestKey testKey;
+  const WideString& path = testKey.path;
   Handle client = Connect();
   ASSERT_TRUE(client);
 
@@ -369,12 +344,7 @@ TEST_F(PipeServerTest, RegistryThroughThePipeReportsNeededSize) {
   Exchange refused = Send(client.Get(), cut.get(), cutAt);
   EXPECT_EQ(refused.Result(), static_cast<DWORD>(ERROR_INVALID_PARAMETER));
   EXPECT_EQ(refused.reply.size(), sizeof(CommandMessage));
-  ASSERT_EQ(RegOpenKeyExW(HKEY_CURRENT_USER, path.c_str(), 0, KEY_READ, &key), ERROR_SUCCESS);
-  DWORD size = 0;
-  EXPECT_EQ(RegQueryValueExW(key, WSTR("CutName"), nullptr, nullptr, nullptr, &size),
-            static_cast<LSTATUS>(ERROR_FILE_NOT_FOUND));
-  RegCloseKey(key);
-  RegDeleteKeyW(HKEY_CURRENT_USER, path.c_str());
+  EXPECT_FALSE(testKey.HasValue(WSTR("CutName")));
 }
 
 }  // namespace

@@ -23,16 +23,6 @@ using pipetest::NewCommand;
 // A key of this case's own below HKEY_CURRENT_USER\Software, removed at the end.
 class RegistryRequestTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    path_ = Utf8ToWide("Software\\" + skytest::UniqueStem("reg"));
-    HKEY key = nullptr;
-    ASSERT_EQ(RegCreateKeyExW(HKEY_CURRENT_USER, path_.c_str(), 0, nullptr, 0, KEY_ALL_ACCESS,
-                              nullptr, &key, nullptr),
-              ERROR_SUCCESS);
-    RegCloseKey(key);
-  }
-  void TearDown() override { RegDeleteKeyW(HKEY_CURRENT_USER, path_.c_str()); }
-
   // A full-length command 13 message for this case's key.
   std::unique_ptr<CommandMessage> Request(const char* name, DWORD operation, DWORD type,
                                           const void* data, DWORD dataLength) {
@@ -77,13 +67,8 @@ class RegistryRequestTest : public ::testing::Test {
     RegCloseKey(key);
   }
 
-  bool ValueExists(const char* name) {
-    DWORD type = 0;
-    std::vector<BYTE> data;
-    return ReadValue(name, &type, &data);
-  }
-
-  WideString path_;
+  pipetest::TestKey key_;
+  const WideString& path_ = key_.path;
 };
 
 std::vector<BYTE> Pattern(std::size_t size) {
@@ -92,7 +77,7 @@ std::vector<BYTE> Pattern(std::size_t size) {
   return data;
 }
 
-TEST_F(RegistryRequestTest, SetThenQueryRoundTrips) {
+TEST_F(RegistryRequestTest, OutcomesOfSetQueryAndOtherOperations) {
   const std::vector<BYTE> data = Pattern(100);
   auto set = Request("Blob", kRegistrySet, REG_BINARY, data.data(), 100);
   EXPECT_EQ(Run(set.get()), ERROR_SUCCESS);
@@ -110,18 +95,15 @@ TEST_F(RegistryRequestTest, SetThenQueryRoundTrips) {
   EXPECT_EQ(query->registry.dataLengthHigh, 0u);
   EXPECT_EQ(query->registry.valueType, static_cast<DWORD>(REG_BINARY));
   EXPECT_EQ(std::memcmp(RegistryData(query.get()), data.data(), 100), 0);
-}
 
-TEST_F(RegistryRequestTest, QueryWithSmallAreaGivesMoreDataAndNeededSize) {
+  // A small area gives more-data and the size needed.
   WriteValue("Big", REG_BINARY, Pattern(300));
-  auto query = Request("Big", kRegistryQuery, REG_NONE, nullptr, 10);
-  EXPECT_EQ(Run(query.get()), static_cast<DWORD>(ERROR_MORE_DATA));
-  EXPECT_EQ(query->registry.dataLength, 300u);
-}
+  auto small = Request("Big", kRegistryQuery, REG_NONE, nullptr, 10);
+  EXPECT_EQ(Run(small.get()), static_cast<DWORD>(ERROR_MORE_DATA));
+  EXPECT_EQ(small->registry.dataLength, 300u);
 
-TEST_F(RegistryRequestTest, MissingKeyOrValueGivesNotFound) {
-  auto query = Request("Absent", kRegistryQuery, REG_NONE, nullptr, 64);
-  EXPECT_EQ(Run(query.get()), static_cast<DWORD>(ERROR_FILE_NOT_FOUND));
+  auto absent = Request("Absent", kRegistryQuery, REG_NONE, nullptr, 64);
+  EXPECT_EQ(Run(absent.get()), static_cast<DWORD>(ERROR_FILE_NOT_FOUND));
 
   auto missingKey = NewCommand(kCommandRegistry);
   const WideString path = path_ + Utf8ToWide("\\NoSuchKey");
@@ -129,13 +111,11 @@ TEST_F(RegistryRequestTest, MissingKeyOrValueGivesNotFound) {
                                     WSTR("x"), kRegistryQuery, REG_NONE, nullptr, 64));
   EXPECT_EQ(Run(missingKey.get()), static_cast<DWORD>(ERROR_FILE_NOT_FOUND));
   EXPECT_EQ(missingKey->registry.dataLength, 64u);  // the request's own length stays
-}
 
-TEST_F(RegistryRequestTest, OtherOperationOnlyOpensTheKey) {
-  const std::vector<BYTE> data = Pattern(8);
+  // Any other operation only opens the key.
   auto request = Request("Untouched", 2, REG_BINARY, data.data(), 8);
   EXPECT_EQ(Run(request.get()), ERROR_SUCCESS);
-  EXPECT_FALSE(ValueExists("Untouched"));
+  EXPECT_FALSE(key_.HasValue(WSTR("Untouched")));
 }
 
 TEST_F(RegistryRequestTest, RootKeyMustBePredefined) {
@@ -161,7 +141,7 @@ TEST_F(RegistryRequestTest, RootKeyMustBePredefined) {
     EXPECT_EQ(Run(request.get()), static_cast<DWORD>(ERROR_INVALID_PARAMETER)) << std::hex << root;
   }
   RegCloseKey(own);
-  EXPECT_FALSE(ValueExists("Refused"));
+  EXPECT_FALSE(key_.HasValue(WSTR("Refused")));
 
   for (HKEY root : {HKEY_CLASSES_ROOT, HKEY_CURRENT_USER, HKEY_LOCAL_MACHINE, HKEY_USERS,
                     HKEY_CURRENT_CONFIG}) {
@@ -216,7 +196,7 @@ TEST_F(RegistryRequestTest, TextsAndDataMustLieInsideTheBytesDelivered) {
     EXPECT_EQ(Run(request.get(), c.available), static_cast<DWORD>(ERROR_INVALID_PARAMETER))
         << c.what;
   }
-  EXPECT_FALSE(ValueExists("Edge"));
+  EXPECT_FALSE(key_.HasValue(WSTR("Edge")));
 
   // Exactly enough bytes: the data area ends on the last byte delivered.
   auto exact = std::make_unique<CommandMessage>(*base);
@@ -248,13 +228,8 @@ TEST_F(RegistryRequestTest, DataAreaMayEndOnTheLastByteOfTheMessage) {
 class RegistryDispatchTest : public pipetest::MonitorFixture {};
 
 TEST_F(RegistryDispatchTest, BytesNotDeliveredOrBeyondTheDeclaredLengthAreRefused) {
-  const std::string stem = "Software\\" + skytest::UniqueStem("reg");
-  const WideString path = Utf8ToWide(stem);
-  HKEY key = nullptr;
-  ASSERT_EQ(RegCreateKeyExW(HKEY_CURRENT_USER, path.c_str(), 0, nullptr, 0, KEY_ALL_ACCESS, nullptr,
-                            &key, nullptr),
-            ERROR_SUCCESS);
-  RegCloseKey(key);
+  const pipetest::TestKey testKey;
+  const WideString& path = testKey.path;
 
   const DWORD data = 0x01020304;
   auto message = NewCommand(kCommandRegistry);
@@ -285,21 +260,18 @@ TEST_F(RegistryDispatchTest, BytesNotDeliveredOrBeyondTheDeclaredLengthAreRefuse
     EXPECT_EQ(dispatch(kCommandMaxLength, dataEnd - 1),
               static_cast<DWORD>(ERROR_INVALID_PARAMETER));
   }
-  HKEY check = nullptr;
-  ASSERT_EQ(RegOpenKeyExW(HKEY_CURRENT_USER, path.c_str(), 0, KEY_READ, &check), ERROR_SUCCESS);
-  DWORD size = 0;
-  EXPECT_EQ(RegQueryValueExW(check, WSTR("Cut"), nullptr, nullptr, nullptr, &size),
-            static_cast<LSTATUS>(ERROR_FILE_NOT_FOUND));
+  EXPECT_FALSE(testKey.HasValue(WSTR("Cut")));
   // Delivered and declared: stored.
   EXPECT_EQ(dispatch(static_cast<DWORD>(dataEnd), kCommandMaxLength), ERROR_SUCCESS);
+  HKEY check = nullptr;
+  ASSERT_EQ(RegOpenKeyExW(HKEY_CURRENT_USER, path.c_str(), 0, KEY_READ, &check), ERROR_SUCCESS);
   DWORD stored = 0;
-  size = sizeof(stored);
+  DWORD size = sizeof(stored);
   EXPECT_EQ(RegQueryValueExW(check, WSTR("Cut"), nullptr, nullptr, reinterpret_cast<BYTE*>(&stored),
                              &size),
             ERROR_SUCCESS);
   EXPECT_EQ(stored, data);
   RegCloseKey(check);
-  RegDeleteKeyW(HKEY_CURRENT_USER, path.c_str());
 }
 
 }  // namespace

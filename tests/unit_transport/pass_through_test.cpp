@@ -1,6 +1,7 @@
-// The SCSI pass-through transport against a simulated drive: the command
-// blocks the drive receives, the replies, device errors, and the abort of a
-// pending transfer, including a device that is slow to cancel.
+// The SCSI pass-through transport against a simulated drive: the replies,
+// device errors, and the abort of a pending transfer, including a device that
+// is slow to cancel. The request blocks themselves are pinned byte for byte
+// by the request layout test.
 #include "transport/pass_through.h"
 
 #include <gtest/gtest.h>
@@ -54,38 +55,26 @@ class PassThroughTest : public ::testing::Test {
                        FILE_SHARE_READ | FILE_SHARE_WRITE, nullptr, OPEN_EXISTING, flags, nullptr);
   }
 
-  // The descriptor block of the last SCSI command the drive received.
-  Bytes LastCdb() {
-    Bytes cdb;
-    for (const sim::Command& command : machine_.Commands(kDrive)) {
-      if (command.kind == sim::Command::Kind::Scsi) cdb = command.cdb;
-    }
-    return cdb;
-  }
-
   sim::Machine machine_;
   skytest::Handle disk_;
   skytest::Handle abort_;
   skytest::Handle ownEvent_;
 };
 
-TEST_F(PassThroughTest, CommandsCarryTheirDescriptorBlocksAndReplies) {
+TEST_F(PassThroughTest, CommandsDeliverTheDrivesReplies) {
   DWORD lastLba = 0;
   DWORD blockLength = 0;
   ASSERT_EQ(ScsiReadCapacity(disk_.Get(), &lastLba, &blockLength, abort_.Get()), 0u);
   EXPECT_EQ(lastLba, 4096u);  // wire bytes 00 00 10 00 00 00 02 00
   EXPECT_EQ(blockLength, 512u);
-  EXPECT_EQ(LastCdb(), (Bytes{0x25, 0, 0, 0, 0, 0, 0, 0, 0, 0}));
 
   BYTE inquiry[kInquiryLength] = {};
   ASSERT_EQ(ScsiInquiry(disk_.Get(), inquiry, nullptr), 0u);
-  EXPECT_EQ(LastCdb(), (Bytes{0x12, 0x00, 0x00, 0x00, 74, 0x00}));
   EXPECT_EQ(std::string(reinterpret_cast<char*>(inquiry + 8), 8), "QX      ");
   EXPECT_EQ(std::string(reinterpret_cast<char*>(inquiry + 36), 4), "7B44");
 
   BYTE page[20] = {};
   ASSERT_EQ(ScsiInquiryPage(disk_.Get(), 0xC0, page, sizeof(page), abort_.Get()), 0u);
-  EXPECT_EQ(LastCdb(), (Bytes{0x12, 0x01, 0xC0, 0x00, 20, 0x00}));
   EXPECT_EQ(page[1], 0xC0);
   EXPECT_EQ(std::string(reinterpret_cast<char*>(page + 16), 3), "RCS");
 
@@ -95,7 +84,6 @@ TEST_F(PassThroughTest, CommandsCarryTheirDescriptorBlocksAndReplies) {
   ASSERT_EQ(
       ReceiveDiagnosticPage(disk_.Get(), 0x82, status, sizeof(status), &overlapped, abort_.Get()),
       0u);
-  EXPECT_EQ(LastCdb(), (Bytes{0x1C, 0x01, 0x82, 0x00, 8, 0x00}));
   EXPECT_EQ(status[0], 0x82);
   EXPECT_EQ(status[4], 0x40);
 
@@ -104,7 +92,6 @@ TEST_F(PassThroughTest, CommandsCarryTheirDescriptorBlocksAndReplies) {
   overlapped.hEvent = ownEvent_.Get();
   SetLastError(ERROR_GEN_FAILURE);
   ASSERT_EQ(SendDiagnosticPage(disk_.Get(), notice, sizeof(notice), &overlapped, nullptr), 0u);
-  EXPECT_EQ(LastCdb(), (Bytes{0x1D, 0x10, 0x00, 0x00, 5, 0x00}));
   const std::vector<sim::Command> commands = machine_.Commands(kDrive);
   ASSERT_FALSE(commands.empty());
   EXPECT_EQ(commands.back().data, Bytes(notice, notice + sizeof(notice)));
