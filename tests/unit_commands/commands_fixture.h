@@ -18,15 +18,14 @@
 #include "monitor/monitor_state.h"
 #include "platform/wide.h"
 #include "service/process_locks.h"
+#include "support/channel_helpers.h"
 #include "volume/volume_letters.h"
 
 namespace cmdtest {
 
 using Bytes = std::vector<std::uint8_t>;
 
-inline std::string Narrow(const WCHAR* text) {
-  return WideToUtf8(WideView(text, WideLength(text)));
-}
+using testsupport::Narrow;
 
 // A machine whose enclosure can be told to keep reporting the removal bit:
 // every read of its event page is preceded by a press, as if the button were
@@ -143,11 +142,7 @@ class CommandTest : public ::testing::Test {
   }
 
   void TearDown() override {
-    for (int i = 0; i < Block().channelCount; ++i) {
-      ChannelRecord& channel = Block().channels[i];
-      if (channel.deviceHandle != nullptr) CloseHandle(channel.deviceHandle);
-      channel.deviceHandle = nullptr;
-    }
+    testsupport::CloseChannelHandles(Block());
     machine_.WaitForDeviceEvents();
     machine_.Uninstall();
     CloseHandle(monitorState.workerStopEvent);
@@ -155,27 +150,12 @@ class CommandTest : public ::testing::Test {
     monitorState = MonitorState{};
   }
 
-  // Opens the shared handle as the worker starter does.
-  static void OpenShared(ChannelRecord* channel) {
-    const bool readWrite = channel->kind == kChannelKindHid || channel->mode != 0;
-    channel->deviceHandle =
-        CreateFileW(channel->devicePath, readWrite ? GENERIC_READ | GENERIC_WRITE : 0,
-                    readWrite ? FILE_SHARE_READ | FILE_SHARE_WRITE : 0, nullptr, OPEN_EXISTING,
-                    FILE_FLAG_OVERLAPPED, nullptr);
-    ASSERT_NE(channel->deviceHandle, INVALID_HANDLE_VALUE) << Narrow(channel->devicePath);
-  }
+  static void OpenShared(ChannelRecord* channel) { testsupport::OpenSharedChannelHandle(channel); }
 
   StateBlock& Block() { return *block_; }
 
-  // The channel whose device path contains `part` (lower case).
   ChannelRecord* Channel(const std::string& part) {
-    for (int i = 0; i < Block().channelCount; ++i) {
-      if (Narrow(Block().channels[i].devicePath).find(part) != std::string::npos) {
-        return &Block().channels[i];
-      }
-    }
-    ADD_FAILURE() << "no channel with " << part;
-    return &Block().channels[kMaxChannels - 1];
+    return testsupport::FindChannel(Block(), part);
   }
   ChannelRecord* Gauge() { return Channel("pid_7b44"); }
   ChannelRecord* Plain() { return Channel("pid_2a31"); }

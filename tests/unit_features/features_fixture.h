@@ -18,6 +18,7 @@
 #include "monitor/monitor_state.h"
 #include "platform/wide.h"
 #include "service/process_locks.h"
+#include "support/channel_helpers.h"
 #include "transport/button_events.h"
 #include "volume/volume_letters.h"
 
@@ -28,9 +29,7 @@ using Kind = sim::Command::Kind;
 
 constexpr std::uint64_t kMiB = 1ull << 20;
 
-inline std::string Narrow(const WCHAR* text) {
-  return WideToUtf8(WideView(text, WideLength(text)));
-}
+using testsupport::Narrow;
 
 inline sim::VolumeSpec Volume(char letter, std::uint64_t sizeMiB, std::uint64_t freeMiB) {
   sim::VolumeSpec volume;
@@ -128,11 +127,7 @@ class FeatureTest : public ::testing::Test {
   }
 
   void TearDown() override {
-    for (int i = 0; i < kMaxChannels; ++i) {
-      ChannelRecord& channel = Block().channels[i];
-      if (channel.deviceHandle != nullptr) CloseHandle(channel.deviceHandle);
-      channel.deviceHandle = nullptr;
-    }
+    testsupport::CloseChannelHandles(Block());
     machine_.WaitForDeviceEvents();
     machine_.Uninstall();
     ReleaseMutex(monitorState.stateMutex);
@@ -142,27 +137,12 @@ class FeatureTest : public ::testing::Test {
     monitorState = MonitorState{};
   }
 
-  // Opens the shared handle as the worker starter does.
-  static void OpenShared(ChannelRecord* channel) {
-    const bool readWrite = channel->kind == kChannelKindHid || channel->mode != 0;
-    channel->deviceHandle =
-        CreateFileW(channel->devicePath, readWrite ? GENERIC_READ | GENERIC_WRITE : 0,
-                    readWrite ? FILE_SHARE_READ | FILE_SHARE_WRITE : 0, nullptr, OPEN_EXISTING,
-                    FILE_FLAG_OVERLAPPED, nullptr);
-    ASSERT_NE(channel->deviceHandle, INVALID_HANDLE_VALUE) << Narrow(channel->devicePath);
-  }
+  static void OpenShared(ChannelRecord* channel) { testsupport::OpenSharedChannelHandle(channel); }
 
   StateBlock& Block() { return *block_; }
 
-  // The channel whose device path contains `part` (lower case).
   ChannelRecord* Channel(const std::string& part) {
-    for (int i = 0; i < Block().channelCount; ++i) {
-      if (Narrow(Block().channels[i].devicePath).find(part) != std::string::npos) {
-        return &Block().channels[i];
-      }
-    }
-    ADD_FAILURE() << "no channel with " << part;
-    return &Block().channels[kMaxChannels - 1];
+    return testsupport::FindChannel(Block(), part);
   }
   ChannelRecord* Gauge() { return Channel("pid_7b44"); }
   ChannelRecord* Plain() { return Channel("pid_2a31"); }
