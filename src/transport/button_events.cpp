@@ -108,7 +108,7 @@ BYTE ReadButtonEvent(ChannelRecord* channel) {
         break;
       }
       error = GetLastError();
-      CancelAndSettle(device, &overlapped);
+      SettleCancelledRequest(device, &overlapped);
       pending = false;
     }
   }
@@ -124,7 +124,7 @@ BYTE ReadButtonEvent(ChannelRecord* channel) {
     }
   }
   // Only a stop leaves the read outstanding; it must end before its buffers go.
-  if (pending) CancelAndSettle(device, &overlapped);
+  if (pending) SettleCancelledRequest(device, &overlapped);
   CloseHandle(ownEvent);
   SetLastError(error);
   return result;

@@ -72,7 +72,7 @@ bool AwaitCompletion(HANDLE device, BOOL startedOk, OVERLAPPED* overlapped) {
     DWORD bytes = 0;
     return GetOverlappedResult(device, overlapped, &bytes, FALSE) != FALSE;
   }
-  CancelAndSettle(device, overlapped);
+  SettleCancelledRequest(device, overlapped);
   SetLastError(ERROR_OPERATION_ABORTED);
   return false;
 }
@@ -187,12 +187,6 @@ WORD WordValue(const BYTE* buffer, DWORD length) {
 }
 
 }  // namespace
-
-void CancelAndSettle(HANDLE device, OVERLAPPED* overlapped) {
-  CancelIo(device);
-  DWORD bytes = 0;
-  GetOverlappedResult(device, overlapped, &bytes, TRUE);
-}
 
 WORD TranslateHidCommandValue(WORD value) {
   switch (value) {

@@ -38,7 +38,3 @@ DWORD DriveCommand(ChannelRecord* channel, DWORD controlCode, BYTE* buffer, DWOR
                    HANDLE abortEvent);
 // The value a HID channel in gauge mode sends for a command value.
 WORD TranslateHidCommandValue(WORD value);
-
-// Cancels the calling thread's I/O on the handle and returns only once the
-// request on `overlapped` has really ended, so that its buffers may go.
-void CancelAndSettle(HANDLE device, OVERLAPPED* overlapped);

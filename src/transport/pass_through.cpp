@@ -50,19 +50,6 @@ void FillRequest(PassThroughRequest* request, BYTE cdbLength, BYTE dataIn, DWORD
   request->totalLength = sizeof(PassThroughRequest);
 }
 
-// Cancels a request that may still be pending and returns only once it has
-// really completed: the grace wait first, then without limit, because the
-// device may write into the request's buffers until it completes.
-void SettleCancelledRequest(HANDLE device, OVERLAPPED* overlapped) {
-  CancelIo(device);
-  if (overlapped->hEvent != nullptr &&
-      WaitForSingleObject(overlapped->hEvent, kCancelGraceMs) == WAIT_OBJECT_0) {
-    return;
-  }
-  DWORD ignored = 0;
-  GetOverlappedResult(device, overlapped, &ignored, TRUE);
-}
-
 // Waits for a pending request or the abort event (may be null). Leaves the
 // request completed in every outcome.
 WaitOutcome WaitForRequest(HANDLE device, OVERLAPPED* overlapped, HANDLE abortEvent, DWORD* bytes) {
@@ -208,4 +195,14 @@ DWORD SendDiagnosticPage(HANDLE device, const BYTE* buffer, BYTE length, OVERLAP
   FillRequest(block.Get(), sizeof(cdb), SCSI_IOCTL_DATA_OUT, length, const_cast<BYTE*>(buffer),
               cdb);
   return SendDiagnostic(device, block.Get(), overlapped, abortEvent);
+}
+
+void SettleCancelledRequest(HANDLE device, OVERLAPPED* overlapped) {
+  CancelIo(device);
+  if (overlapped->hEvent != nullptr &&
+      WaitForSingleObject(overlapped->hEvent, kCancelGraceMs) == WAIT_OBJECT_0) {
+    return;
+  }
+  DWORD ignored = 0;
+  GetOverlappedResult(device, overlapped, &ignored, TRUE);
 }

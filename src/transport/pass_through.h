@@ -56,3 +56,10 @@ DWORD ReceiveDiagnosticPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE len
 // buffer holds the whole page, header included.
 DWORD SendDiagnosticPage(HANDLE device, const BYTE* buffer, BYTE length, OVERLAPPED* overlapped,
                          HANDLE abortEvent);
+
+// Cancels the calling thread's I/O on the handle and returns only once the
+// request on `overlapped` has really completed (a grace wait on its event
+// first, then without limit), because the device may write into the
+// request's buffers until it completes. Every transport that abandons a
+// pending request uses it.
+void SettleCancelledRequest(HANDLE device, OVERLAPPED* overlapped);
