@@ -2,7 +2,7 @@
 // emulation namespace and registry store of its own (unless the environment
 // already names them, as for a child started by RunChildSelf), so parallel
 // test programs never see each other's named objects, pipes or registry; it
-// removes both at exit. Every case is checked for leaked handles and threads.
+// removes the registry at exit (the namespace ends with its last process). Every case is checked for leaked handles and threads.
 #include <gtest/gtest.h>
 
 #include <cstdlib>
@@ -16,17 +16,12 @@
 
 #include <filesystem>
 #include <random>
-#if __has_include("platform/posix/namespace.h")
-#include "platform/posix/namespace.h"
-#define SKYVANE_TEST_HAS_NAMESPACE 1
-#endif
 #endif
 
 namespace {
 
 #if !defined(_WIN32)
 struct Isolation {
-  bool ownNamespace = false;
   std::filesystem::path registryDir;
 };
 
@@ -43,7 +38,6 @@ void Isolate(Isolation& isolation) {
   std::string tag = std::to_string(getpid()) + "-" + std::to_string(random() % 1000000);
   if (!IsSet("SKYVANE_NAMESPACE")) {
     setenv("SKYVANE_NAMESPACE", ("t" + tag).c_str(), 1);
-    isolation.ownNamespace = true;
   }
   if (!IsSet("SKYVANE_REGISTRY")) {
     std::filesystem::path directory;
@@ -62,9 +56,6 @@ Isolation g_isolation;
 // Runs at exit, also when a case ends the process through exit().
 void Release() {
   const Isolation& isolation = g_isolation;
-#if defined(SKYVANE_TEST_HAS_NAMESPACE)
-  if (isolation.ownNamespace) static_cast<void>(emu::DestroyNamespace());
-#endif
   if (!isolation.registryDir.empty()) {
     std::error_code ignored;
     std::filesystem::remove_all(isolation.registryDir, ignored);

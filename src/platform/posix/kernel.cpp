@@ -1,145 +1,143 @@
+// The kernel lock with its journal, the futex waits and the slot table.
 #include "platform/posix/kernel.h"
 
 #include <errno.h>
-#include <fcntl.h>
-#include <sys/file.h>
-#include <sys/mman.h>
-#include <sys/stat.h>
+#include <linux/futex.h>
+#include <signal.h>
+#include <sys/syscall.h>
 #include <time.h>
 #include <unistd.h>
 
+#include <climits>
 #include <cmath>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <new>
-#include <string>
 
 namespace emu::kernel {
 namespace {
 
-constexpr std::uint64_t kMagic = 0x314C4E524B56534BULL;  // "KSVKRNL1"
-constexpr std::uint32_t kVersion = 4;
-
-std::string& NamespaceString() {
-  static std::string* name = [] {
-    const char* env = std::getenv("SKYVANE_NAMESPACE");
-    std::string value = env != nullptr && env[0] != '\0'
-                            ? std::string(env)
-                            : "skyvane-" + std::to_string(static_cast<unsigned long>(getuid()));
-    for (char& c : value) {
-      if (c == '/') c = '_';
-    }
-    return new std::string(value);
-  }();
-  return *name;
-}
-
-std::string& RegionPathString() {
-  static std::string* path = new std::string("/dev/shm/" + NamespaceString());
-  return *path;
-}
-
-void Die(const char* what) {
-  std::fprintf(stderr, "skyvane emulation: %s failed: %s\n", what, std::strerror(errno));
+[[noreturn]] void Fatal(const char* what) {
+  std::fprintf(stderr, "skyvane emulation: %s\n", what);
   std::abort();
 }
 
-// The file is new and zero-filled (pages stay unallocated until used).
-void InitializeRegion(Region* region) {
-  pthread_mutexattr_t mutexAttr;
-  pthread_mutexattr_init(&mutexAttr);
-  pthread_mutexattr_setpshared(&mutexAttr, PTHREAD_PROCESS_SHARED);
-  pthread_mutexattr_setrobust(&mutexAttr, PTHREAD_MUTEX_ROBUST);
-  pthread_mutex_init(&region->lock, &mutexAttr);
-  pthread_mutexattr_destroy(&mutexAttr);
-  pthread_condattr_t condAttr;
-  pthread_condattr_init(&condAttr);
-  pthread_condattr_setpshared(&condAttr, PTHREAD_PROCESS_SHARED);
-  pthread_condattr_setclock(&condAttr, CLOCK_MONOTONIC);
-  pthread_cond_init(&region->changed, &condAttr);
-  pthread_condattr_destroy(&condAttr);
-  region->size = sizeof(Region);
-  region->version = kVersion;
-  region->magic = kMagic;
+// ---- Journal ------------------------------------------------------------------
+
+void Rollback(Region& region) {
+  Journal& journal = region.journal;
+  if (journal.count > kJournalEntries || journal.bytes > kJournalBytes) {
+    Fatal("the kernel journal is damaged");
+  }
+  std::uint32_t end = journal.bytes;
+  for (std::uint32_t i = journal.count; i-- > 0;) {
+    const JournalEntry& entry = journal.entries[i];
+    end -= entry.length;
+    std::memcpy(reinterpret_cast<std::uint8_t*>(&region) + entry.offset, journal.data + end,
+                entry.length);
+  }
+  journal.count = 0;
+  journal.bytes = 0;
 }
 
-// Creates or attaches the region. An flock on the file serialises the first
-// initialisation between processes; a file of another layout is replaced.
-Region* AttachRegion() {
-  const char* path = RegionPathString().c_str();
-  int fd = open(path, O_RDWR | O_CREAT | O_CLOEXEC, 0600);
-  if (fd < 0) Die("open of the shared region");
-  if (flock(fd, LOCK_EX) != 0) Die("flock of the shared region");
-  struct stat info {};
-  if (fstat(fd, &info) != 0) Die("fstat of the shared region");
-  bool fresh = static_cast<std::uint64_t>(info.st_size) != sizeof(Region);
-  if (!fresh) {
-    struct Header {
-      std::uint64_t magic;
-      std::uint32_t version;
-      std::uint32_t reserved;
-      std::uint64_t size;
-    } header{};
-    static_assert(offsetof(Region, lock) == sizeof(Header));
-    if (pread(fd, &header, sizeof(header), 0) != static_cast<ssize_t>(sizeof(header))) {
-      fresh = true;
-    } else {
-      fresh = header.magic != kMagic || header.version != kVersion || header.size != sizeof(Region);
+void Commit(Region& region) {
+  region.journal.count = 0;
+  region.journal.bytes = 0;
+}
+
+// ---- Lock -------------------------------------------------------------------------
+
+// Nested holds by one thread (an object released while the lock is held
+// takes it again to drop its slot) lock the mutex only once.
+thread_local int t_lockDepth = 0;
+
+void WakeAll(Region& region);
+
+// Takes the mutex; when its owner died, undoes what that owner left half
+// done and cleans up after its process.
+void Acquire(Region& region) {
+  int result;
+  do {
+    result = pthread_mutex_lock(&region.lock);
+  } while (result == EINTR);
+  if (result == EOWNERDEAD) {
+    ProcessId dead = region.lockOwner;
+    Rollback(region);
+    region.lockOwner = Self();
+    if (!SameProcess(dead, Self()) && !ProcessAlive(dead)) ReapProcess(dead);
+    Commit(region);
+    pthread_mutex_consistent(&region.lock);
+    // Its wake-ups may have been lost with it.
+    WakeAll(region);
+    return;
+  }
+  if (result != 0) {
+    errno = result;
+    Fatal("the kernel lock failed");
+  }
+  region.lockOwner = Self();
+}
+
+void Release(Region& region) {
+  Commit(region);
+  pthread_mutex_unlock(&region.lock);
+}
+
+// ---- Futex --------------------------------------------------------------------------
+
+long Futex(std::uint32_t* word, int op, std::uint32_t value, const timespec* at) {
+  return syscall(SYS_futex, word, op, value, at, nullptr, FUTEX_BITSET_MATCH_ANY);
+}
+
+void WakeWaiter(Waiter& waiter) {
+  __atomic_add_fetch(&waiter.word, 1, __ATOMIC_SEQ_CST);
+  Futex(&waiter.word, FUTEX_WAKE, INT_MAX, nullptr);
+}
+
+void WakeAll(Region& region) {
+  for (std::uint32_t i = 0; i < region.waiterHigh; ++i) {
+    if (region.waiters[i].inUse != 0) WakeWaiter(region.waiters[i]);
+  }
+}
+
+int AllocateWaiter(Region& region) {
+  for (int pass = 0; pass < 2; ++pass) {
+    for (std::uint32_t i = 0; i < kWaiterCount; ++i) {
+      Waiter& waiter = region.waiters[i];
+      if (waiter.inUse != 0) continue;
+      Touch(waiter);
+      waiter.inUse = 1;
+      waiter.process = Self();
+      if (i >= region.waiterHigh) {
+        Touch(region.waiterHigh);
+        region.waiterHigh = i + 1;
+      }
+      return static_cast<int>(i);
+    }
+    // Full: free the records of processes that died.
+    for (Waiter& waiter : region.waiters) {
+      if (waiter.inUse != 0 && !ProcessAlive(waiter.process)) {
+        Touch(waiter);
+        waiter.inUse = 0;
+      }
     }
   }
-  if (fresh) {
-    if (ftruncate(fd, 0) != 0 || ftruncate(fd, static_cast<off_t>(sizeof(Region))) != 0) {
-      Die("ftruncate of the shared region");
-    }
+  return -1;
+}
+
+void FreeWaiter(Region& region, std::uint32_t index) {
+  Touch(region.waiters[index]);
+  region.waiters[index].inUse = 0;
+  region.waiters[index].keyCount = 0;
+  if (index + 1 == region.waiterHigh) {
+    std::uint32_t high = index;
+    while (high > 0 && region.waiters[high - 1].inUse == 0) --high;
+    Touch(region.waiterHigh);
+    region.waiterHigh = high;
   }
-  void* memory = mmap(nullptr, sizeof(Region), PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
-  if (memory == MAP_FAILED) Die("mmap of the shared region");
-  auto* region = static_cast<Region*>(memory);
-  if (fresh) InitializeRegion(region);
-  flock(fd, LOCK_UN);
-  close(fd);
-  return region;
 }
 
-ProcessId g_self{};
-
-// Reads state and start time of `pid` from /proc; false when it is gone.
-bool ReadProcess(std::int32_t pid, char* state, std::uint64_t* startTime) {
-  char path[64];
-  std::snprintf(path, sizeof(path), "/proc/%d/stat", pid);
-  FILE* file = std::fopen(path, "re");
-  if (file == nullptr) return false;
-  char buffer[1024];
-  size_t length = std::fread(buffer, 1, sizeof(buffer) - 1, file);
-  std::fclose(file);
-  buffer[length] = '\0';
-  const char* close = std::strrchr(buffer, ')');
-  if (close == nullptr) return false;
-  const char* p = close + 1;
-  while (*p == ' ') ++p;
-  *state = *p;
-  int field = 3;
-  while (*p != '\0' && field < 22) {
-    while (*p != ' ' && *p != '\0') ++p;
-    while (*p == ' ') ++p;
-    ++field;
-  }
-  *startTime = field == 22 ? std::strtoull(p, nullptr, 10) : 0;
-  return true;
-}
-
-ProcessId ReadSelf() {
-  ProcessId id{};
-  id.pid = static_cast<std::int32_t>(getpid());
-  char state = 0;
-  ReadProcess(id.pid, &state, &id.startTime);  // on failure 0, which still matches itself
-  return id;
-}
-
-void ForkChild() {
-  g_self = ReadSelf();
-}
+// ---- Slots --------------------------------------------------------------------------
 
 bool NameEqual(const WCHAR* a, const WCHAR* b) {
   for (std::uint32_t i = 0; i < kNameCapacity; ++i) {
@@ -149,71 +147,84 @@ bool NameEqual(const WCHAR* a, const WCHAR* b) {
   return true;
 }
 
-void FreeSlot(Slot& slot, std::uint32_t index) {
-  std::uint32_t kind = slot.kind;
-  std::uint32_t generation = slot.generation;
+void FreeSlot(Slot& slot) {
+  Touch(slot);
+  if (slot.kind == kMapping) MappingSlotFreed(slot);
   std::uint32_t nextGeneration = slot.generation + 1;
   std::memset(static_cast<void*>(&slot), 0, sizeof(Slot));
   slot.generation = nextGeneration;
-  if (kind == kMapping) MappingSlotFreed(index, generation);
 }
 
 // Drops holders that died; frees the slot (and returns true) when none is left.
-bool SweepSlot(Slot& slot, std::uint32_t index) {
+bool SweepSlot(Slot& slot) {
   bool anyLeft = false;
   for (Holder& holder : slot.holders) {
     if (holder.count == 0) continue;
-    if (!SameProcess(holder.process, Self()) && !ProcessAlive(holder.process)) {
+    if (!ProcessAlive(holder.process)) {
+      Touch(holder);
       holder = Holder{};
       continue;
     }
     anyLeft = true;
   }
   if (!anyLeft) {
-    FreeSlot(slot, index);
+    FreeSlot(slot);
     return true;
   }
   return false;
 }
 
-}  // namespace
+char g_crashPoint[64] = {};
 
-Region& GetRegion() {
-  static Region* region = [] {
-    g_self = ReadSelf();
-    pthread_atfork(nullptr, nullptr, ForkChild);
-    return AttachRegion();
-  }();
-  return *region;
-}
-
-const char* NamespaceName() {
-  return NamespaceString().c_str();
-}
-const char* RegionPath() {
-  return RegionPathString().c_str();
-}
-
-namespace {
-// Nested holds by one thread (an object released while the lock is held
-// takes it again to drop its slot) lock the mutex only once.
-thread_local int t_lockDepth = 0;
 }  // namespace
 
 Lock::Lock() {
   if (t_lockDepth++ != 0) return;
-  Region& region = GetRegion();
-  int result = pthread_mutex_lock(&region.lock);
-  if (result == EOWNERDEAD) {
-    pthread_mutex_consistent(&region.lock);
-  } else if (result != 0) {
-    errno = result;
-    Die("lock of the shared region");
-  }
+  Acquire(GetRegion());
 }
 
 Lock::~Lock() {
-  if (--t_lockDepth == 0) pthread_mutex_unlock(&GetRegion().lock);
+  if (--t_lockDepth != 0) return;
+  Release(GetRegion());
+}
+
+bool Journalled(const void* address) {
+  Region& region = GetRegion();
+  auto offset = static_cast<std::uint32_t>(static_cast<const std::uint8_t*>(address) -
+                                           reinterpret_cast<const std::uint8_t*>(&region));
+  const Journal& journal = region.journal;
+  for (std::uint32_t i = 0; i < journal.count; ++i) {
+    if (journal.entries[i].offset <= offset &&
+        offset < journal.entries[i].offset + journal.entries[i].length) {
+      return true;
+    }
+  }
+  return false;
+}
+
+void LockForFork() {
+  if (t_lockDepth == 0) Acquire(GetRegion());
+}
+
+void UnlockAfterFork() {
+  if (t_lockDepth == 0) Release(GetRegion());
+}
+
+void Save(const void* address, std::size_t length) {
+  Region& region = GetRegion();
+  auto* base = reinterpret_cast<const std::uint8_t*>(&region);
+  auto* at = static_cast<const std::uint8_t*>(address);
+  if (at < base || at + length > base + sizeof(Region)) Fatal("journal of memory outside the region");
+  Journal& journal = region.journal;
+  if (journal.count == kJournalEntries || journal.bytes + length > kJournalBytes) {
+    Fatal("the kernel journal is full");
+  }
+  std::memcpy(journal.data + journal.bytes, at, length);
+  journal.entries[journal.count] = JournalEntry{static_cast<std::uint32_t>(at - base),
+                                                static_cast<std::uint32_t>(length)};
+  journal.bytes += static_cast<std::uint32_t>(length);
+  // The entry counts only once its bytes are saved.
+  __atomic_store_n(&journal.count, journal.count + 1, __ATOMIC_RELEASE);
 }
 
 std::int64_t NowNs() {
@@ -247,47 +258,86 @@ std::int64_t DeadlineAfter(DWORD milliseconds) {
   return NowNs() + static_cast<std::int64_t>(milliseconds) * 1000000LL;
 }
 
-void Broadcast() {
+void Notify(std::uint32_t key) {
   Region& region = GetRegion();
-  ++region.changeCount;
-  pthread_cond_broadcast(&region.changed);
+  for (std::uint32_t i = 0; i < region.waiterHigh; ++i) {
+    Waiter& waiter = region.waiters[i];
+    if (waiter.inUse == 0) continue;
+    for (std::uint32_t k = 0; k < waiter.keyCount; ++k) {
+      if (waiter.keys[k] == key) {
+        WakeWaiter(waiter);
+        break;
+      }
+    }
+  }
 }
 
-bool WaitChange(std::int64_t deadlineNs, int pollMs) {
-  std::int64_t now = NowNs();
-  if (deadlineNs >= 0 && now >= deadlineNs) return false;
-  std::int64_t until = now + static_cast<std::int64_t>(pollMs) * 1000000LL;
-  if (deadlineNs >= 0 && deadlineNs < until) until = deadlineNs;
+bool WaitKeys(const std::uint32_t* keys, std::uint32_t count, std::int64_t deadlineNs) {
+  if (deadlineNs >= 0 && NowNs() >= deadlineNs) return false;
+  Region& region = GetRegion();
+  if (count > kMaxWaitKeys) Fatal("a wait on too many objects");
+  int index = AllocateWaiter(region);
   timespec at{};
-  at.tv_sec = static_cast<time_t>(until / 1000000000LL);
-  at.tv_nsec = static_cast<long>(until % 1000000000LL);
-  Region& region = GetRegion();
-  int result = pthread_cond_timedwait(&region.changed, &region.lock, &at);
-  if (result == EOWNERDEAD) pthread_mutex_consistent(&region.lock);
+  if (deadlineNs >= 0) {
+    at.tv_sec = static_cast<time_t>(deadlineNs / 1000000000LL);
+    at.tv_nsec = static_cast<long>(deadlineNs % 1000000000LL);
+  }
+  if (index < 0) {
+    // Every record taken by live waiters: sleep a moment and let the caller
+    // look again, rather than fail the wait.
+    Release(region);
+    timespec pause{0, 1000000};
+    nanosleep(&pause, nullptr);
+    Acquire(region);
+    return deadlineNs < 0 || NowNs() < deadlineNs;
+  }
+  Waiter& waiter = region.waiters[index];
+  waiter.keyCount = count;
+  std::memcpy(waiter.keys, keys, count * sizeof(std::uint32_t));
+  std::uint32_t seen = __atomic_load_n(&waiter.word, __ATOMIC_SEQ_CST);
+  Release(region);
+  // A notification between the release and the sleep changed the word, so
+  // the sleep returns at once. EINTR and EAGAIN return to the caller, which
+  // looks again.
+  Futex(&waiter.word, FUTEX_WAIT_BITSET, seen, deadlineNs >= 0 ? &at : nullptr);
+  Acquire(region);
+  FreeWaiter(region, static_cast<std::uint32_t>(index));
   return deadlineNs < 0 || NowNs() < deadlineNs;
-}
-
-const ProcessId& Self() {
-  GetRegion();
-  return g_self;
 }
 
 bool SameProcess(const ProcessId& a, const ProcessId& b) {
   return a.pid == b.pid && a.startTime == b.startTime;
 }
 
-bool ProcessAlive(const ProcessId& process) {
-  if (process.pid <= 0) return false;
-  if (SameProcess(process, Self())) return true;
-  char state = 0;
-  std::uint64_t startTime = 0;
-  if (!ReadProcess(process.pid, &state, &startTime)) return false;
-  if (state == 'Z' || state == 'X') return false;
-  return process.startTime == 0 || startTime == process.startTime;
-}
-
 std::int32_t ThreadId() {
   return static_cast<std::int32_t>(gettid());
+}
+
+void ReapProcess(const ProcessId& process) {
+  if (process.pid <= 0 || SameProcess(process, Self())) return;
+  Region& region = GetRegion();
+  AbandonMutexesOfProcess(process);
+  ClosePipeEndsOfProcess(process);
+  for (Slot& slot : region.slots) {
+    if (slot.kind == kFree) continue;
+    bool held = false;
+    bool anyLeft = false;
+    for (Holder& holder : slot.holders) {
+      if (holder.count == 0) continue;
+      if (SameProcess(holder.process, process)) {
+        Touch(holder);
+        holder = Holder{};
+        held = true;
+      } else {
+        anyLeft = true;
+      }
+    }
+    if (held && !anyLeft) FreeSlot(slot);
+  }
+  for (std::uint32_t i = 0; i < region.waiterHigh; ++i) {
+    Waiter& waiter = region.waiters[i];
+    if (waiter.inUse != 0 && SameProcess(waiter.process, process)) FreeWaiter(region, i);
+  }
 }
 
 bool NormalizeName(const WCHAR* name, WCHAR* out) {
@@ -319,7 +369,7 @@ int FindNamed(const WCHAR* normalizedName) {
     Slot& slot = region.slots[i];
     if (slot.kind == kFree || slot.name[0] == 0) continue;
     if (!NameEqual(slot.name, normalizedName)) continue;
-    if (SweepSlot(slot, i)) return -1;
+    if (SweepSlot(slot)) return -1;
     return static_cast<int>(i);
   }
   return -1;
@@ -331,6 +381,7 @@ bool AllocateSlot(SlotKind kind, const WCHAR* normalizedName, SlotRef* ref) {
     for (std::uint32_t i = 0; i < kSlotCount; ++i) {
       Slot& slot = region.slots[i];
       if (slot.kind != kFree) continue;
+      Touch(slot);
       slot.kind = kind;
       if (normalizedName != nullptr) {
         for (std::uint32_t k = 0; k < kNameCapacity; ++k) {
@@ -345,8 +396,8 @@ bool AllocateSlot(SlotKind kind, const WCHAR* normalizedName, SlotRef* ref) {
       return true;
     }
     // Full: free what dead processes left behind and try once more.
-    for (std::uint32_t i = 0; i < kSlotCount; ++i) {
-      if (region.slots[i].kind != kFree) SweepSlot(region.slots[i], i);
+    for (Slot& slot : region.slots) {
+      if (slot.kind != kFree) SweepSlot(slot);
     }
   }
   return false;
@@ -365,6 +416,7 @@ void AddHolder(const SlotRef& ref) {
   Holder* empty = nullptr;
   for (Holder& holder : slot->holders) {
     if (holder.count != 0 && SameProcess(holder.process, Self())) {
+      Touch(holder);
       ++holder.count;
       return;
     }
@@ -374,16 +426,14 @@ void AddHolder(const SlotRef& ref) {
     // Every entry taken: make room by dropping processes that died.
     for (Holder& holder : slot->holders) {
       if (!ProcessAlive(holder.process)) {
+        Touch(holder);
         holder = Holder{};
         if (empty == nullptr) empty = &holder;
       }
     }
   }
-  if (empty == nullptr) {
-    std::fprintf(stderr, "skyvane emulation: more than %u processes hold one object\n",
-                 kMaxHolders);
-    std::abort();
-  }
+  if (empty == nullptr) Fatal("more processes hold one object than the table has room for");
+  Touch(*empty);
   empty->process = Self();
   empty->count = 1;
 }
@@ -394,11 +444,23 @@ void DropHolder(const SlotRef& ref) {
   bool anyLeft = false;
   for (Holder& holder : slot->holders) {
     if (holder.count != 0 && SameProcess(holder.process, Self())) {
+      Touch(holder);
       if (--holder.count == 0) holder = Holder{};
     }
     if (holder.count != 0) anyLeft = true;
   }
-  if (!anyLeft) FreeSlot(*slot, ref.index);
+  if (!anyLeft) FreeSlot(*slot);
+}
+
+void SetCrashPoint(const char* name) {
+  std::snprintf(g_crashPoint, sizeof(g_crashPoint), "%s", name != nullptr ? name : "");
+}
+
+void CrashPoint(const char* name) {
+  if (g_crashPoint[0] != '\0' && std::strcmp(g_crashPoint, name) == 0) {
+    kill(getpid(), SIGKILL);
+    for (;;) pause();
+  }
 }
 
 }  // namespace emu::kernel

@@ -1,10 +1,19 @@
-// The emulation's "kernel": one shared region per namespace (a file in
-// /dev/shm, mapped by every process of the namespace) holding the state of
-// every waitable object, named object, mapping descriptor and pipe instance,
-// guarded by one robust process-shared mutex with one process-shared
-// condition variable that is broadcast on every change of state. Waits of
-// any kind are condition waits on that variable, which gives exact
-// multi-object wait semantics within and across processes.
+// The emulation's "kernel": one shared region per namespace holding the
+// state of every waitable object, named object, mapping and pipe instance.
+//
+// - The region is an anonymous memory file. Processes find it through the
+//   abstract socket names its members hold (region_attach.cpp), so it and
+//   everything in it vanish with the last process of the namespace, however
+//   that process ends.
+// - One robust process-shared mutex guards it. Every change made under the
+//   lock is journalled first (Save/Touch); a process that dies holding the
+//   lock has its unfinished changes rolled back by the next owner.
+// - Waits sleep on a futex word of their own (a waiter record in the region
+//   naming the object keys waited on); a change wakes only the waiters of
+//   its key (Notify). Nothing polls.
+// - Each process watches the processes it depends on (mutex owners, pipe
+//   peers) through pidfds and cleans up after them when they die
+//   (process_watch.cpp), as Windows does.
 //
 // Everything here except Lock's constructor and the time helpers must be
 // called with the lock held.
@@ -12,6 +21,7 @@
 
 #include <pthread.h>
 
+#include <cstddef>
 #include <cstdint>
 
 #include "platform/posix/win32_base.h"
@@ -23,6 +33,23 @@ constexpr std::uint32_t kNameCapacity = 260;  // units, terminator included
 constexpr std::uint32_t kMaxHolders = 16;
 constexpr std::uint32_t kPipeInstanceCount = 64;
 constexpr std::uint32_t kPipeQueueBytes = 64 * 1024;
+constexpr std::uint32_t kWaiterCount = 512;
+constexpr std::uint32_t kMaxWaitKeys = 72;  // 64 objects, or a process's pipe instances
+constexpr std::uint32_t kJournalEntries = 4096;
+constexpr std::uint32_t kJournalBytes = 1024 * 1024;
+
+// Keys name what a waiter waits for: a slot, a pipe instance, the set of
+// pipe names (an instance that starts or stops listening), or one process
+// (its pipe service thread).
+constexpr std::uint32_t kPipeKeyBase = kSlotCount;
+constexpr std::uint32_t kPipeNamesKey = kPipeKeyBase + kPipeInstanceCount;
+constexpr std::uint32_t kProcessKeyBase = kPipeNamesKey + 1;
+inline std::uint32_t SlotKey(std::uint32_t index) {
+  return index;
+}
+inline std::uint32_t PipeKey(std::uint32_t index) {
+  return kPipeKeyBase + index;
+}
 
 enum SlotKind : std::uint32_t {
   kFree = 0,
@@ -60,8 +87,10 @@ struct Slot {
   std::uint32_t abandoned;
   // Threads.
   std::uint32_t exitCode;
-  // Mappings.
+  // Mappings: size, and where the storage lies in the region's arena.
   std::uint64_t mappingSize;
+  std::uint64_t arenaOffset;
+  std::uint64_t arenaLength;
 };
 
 // One direction of a pipe instance: a ring of records [u32 length][bytes]
@@ -99,29 +128,62 @@ struct PipeInstance {
   PipeQueue toServer;
 };
 
+// A thread asleep in a wait: it sleeps on `word`, which Notify bumps for
+// any of its keys.
+struct Waiter {
+  std::uint32_t word;
+  std::uint32_t inUse;
+  ProcessId process;
+  std::uint32_t keyCount;
+  std::uint32_t reserved;
+  std::uint32_t keys[kMaxWaitKeys];
+};
+
+// Saved bytes of the region that the current lock owner has changed.
+struct JournalEntry {
+  std::uint32_t offset;  // from the region's start
+  std::uint32_t length;
+};
+struct Journal {
+  std::uint32_t count;
+  std::uint32_t bytes;
+  JournalEntry entries[kJournalEntries];
+  std::uint8_t data[kJournalBytes];
+};
+
 struct Region {
   std::uint64_t magic;
   std::uint32_t version;
   std::uint32_t reserved;
   std::uint64_t size;
   pthread_mutex_t lock;
-  pthread_cond_t changed;
-  std::uint64_t changeCount;
+  ProcessId lockOwner;       // the process that holds `lock` (never journalled)
+  std::uint32_t waiterHigh;  // waiters[waiterHigh..] are all free
+  std::uint32_t reserved2;
+  Journal journal;
+  Waiter waiters[kWaiterCount];
   Slot slots[kSlotCount];
   PipeInstance pipes[kPipeInstanceCount];
   // Ring storage of each instance: [0] server to client, [1] client to server.
   std::uint8_t pipeData[kPipeInstanceCount][2][kPipeQueueBytes];
 };
 
+// Mapping storage: an arena in the same memory file, after the region.
+constexpr std::uint64_t kArenaGranularity = 64 * 1024;
+constexpr std::uint64_t kArenaOffset =
+    (sizeof(Region) + kArenaGranularity - 1) / kArenaGranularity * kArenaGranularity;
+constexpr std::uint64_t kArenaBytes = 1ULL << 30;
+
 // The region of this process's namespace, created or attached on first use.
 Region& GetRegion();
+// The memory file behind the region (for mapping views of the arena).
+int RegionFd();
 // The namespace name (SKYVANE_NAMESPACE or "skyvane-<uid>").
 const char* NamespaceName();
-// "/dev/shm/<namespace>" and the prefix of the namespace's other files.
-const char* RegionPath();
 
-// Scoped hold of the kernel lock (a process that died holding it leaves it
-// consistent again for the next owner). A thread may nest holds.
+// Scoped hold of the kernel lock. A thread may nest holds. A process that
+// died holding it has its journalled changes rolled back and its objects
+// cleaned up before the next owner goes on.
 class Lock {
  public:
   Lock();
@@ -129,6 +191,16 @@ class Lock {
   Lock(const Lock&) = delete;
   Lock& operator=(const Lock&) = delete;
 };
+
+// Journals `length` bytes at `address` (inside the region) before the lock
+// owner changes them.
+void Save(const void* address, std::size_t length);
+// Whether the current lock hold has already saved the bytes at `address`.
+bool Journalled(const void* address);
+template <class T>
+void Touch(const T& object) {
+  Save(&object, sizeof(T));
+}
 
 // Monotonic clock in nanoseconds.
 std::int64_t NowNs();
@@ -138,21 +210,26 @@ std::int64_t DeadlineAfter(DWORD milliseconds);
 DWORD ScaleTimeout(DWORD milliseconds);
 double Scale();
 
-// Marks a change of state: wakes every waiter of every process.
-void Broadcast();
-// Waits for the next change or until `deadlineNs` (-1 = none). A wait lasts
-// at most `pollMs` real milliseconds so that callers can look again at
-// processes that may have died. Returns false once the deadline has passed.
-bool WaitChange(std::int64_t deadlineNs, int pollMs = 1000);
-// Short poll used by waits that depend on other processes staying alive.
-constexpr int kLivenessPollMs = 100;
+// Wakes every waiter that waits on `key`.
+void Notify(std::uint32_t key);
+// Sleeps (releasing the lock) until one of `keys` is notified, the deadline
+// (-1 = none) passes or a signal arrives; the lock is held again on return.
+// Callers look at their objects again afterwards: a wake-up may be spurious.
+// Returns false once the deadline has passed.
+bool WaitKeys(const std::uint32_t* keys, std::uint32_t count, std::int64_t deadlineNs);
 
-// This process and a liveness test for others (zombies count as dead).
+// This process and a liveness test for others (zombies count as dead). The
+// first test of a process starts watching it: when it dies, ReapProcess runs
+// for it without anyone having to look.
 const ProcessId& Self();
 bool ProcessAlive(const ProcessId& process);
 bool SameProcess(const ProcessId& a, const ProcessId& b);
 // The calling thread's id (the Linux tid).
 std::int32_t ThreadId();
+// Cleans up after a dead process: its holds are dropped (objects left
+// without holders are destroyed), its mutexes abandoned, its pipe ends
+// closed and its waiter records freed. Idempotent.
+void ReapProcess(const ProcessId& process);
 
 // Slot management. Names are compared exactly; "Global\" and "Local\"
 // prefixes are removed by NormalizeName first.
@@ -174,7 +251,24 @@ void AddHolder(const SlotRef& ref);
 // Drops one hold of this process; frees the slot when no process holds it.
 void DropHolder(const SlotRef& ref);
 
-// Called whenever a slot is freed (mappings unlink their storage file).
-void MappingSlotFreed(std::uint32_t index, std::uint32_t generation);
+// Hooks of the object kinds, called with the lock held.
+// A mapping slot is being freed: its arena range is given back.
+void MappingSlotFreed(const Slot& slot);
+// Mutexes owned by `process` become abandoned.
+void AbandonMutexesOfProcess(const ProcessId& process);
+// Pipe ends held by `process` are closed on its behalf.
+void ClosePipeEndsOfProcess(const ProcessId& process);
+
+// Internal: the fork handlers hold the lock across fork(), so that a child
+// never starts with a region left half changed by another thread; the
+// start time of a process read from /proc (false when it is gone).
+void LockForFork();
+void UnlockAfterFork();
+bool ReadProcessStart(std::int32_t pid, char* state, std::uint64_t* startTime);
+
+// Test hook: when `name` matches the crash point set by the test, the
+// process is killed on the spot (inside the kernel lock).
+void CrashPoint(const char* name);
+void SetCrashPoint(const char* name);
 
 }  // namespace emu::kernel

@@ -1,15 +1,17 @@
-// Pagefile-backed file mappings: the storage of each mapping is a file in
-// /dev/shm next to the kernel region, named after its slot; the slot is held
-// by every handle and every view, and the file is removed with the slot.
+// Pagefile-backed file mappings: the storage of each mapping is a range of
+// the arena that follows the kernel region in the namespace's memory file;
+// the slot is held by every handle and every view, and the range is
+// released (its pages given back, so that it reads as zero when it is
+// used again) when the slot is freed, under the kernel lock.
 #include <fcntl.h>
 #include <pthread.h>
 #include <sys/mman.h>
 #include <unistd.h>
 
-#include <cstdio>
+#include <algorithm>
 #include <map>
 #include <mutex>
-#include <string>
+#include <vector>
 
 #include "platform/posix/kernel.h"
 #include "platform/posix/slot_object.h"
@@ -19,11 +21,6 @@ namespace emu {
 namespace {
 
 constexpr std::uint64_t kAllocationGranularity = 64 * 1024;
-
-std::string MappingPath(std::uint32_t index, std::uint32_t generation) {
-  return std::string(kernel::RegionPath()) + ".map." + std::to_string(index) + "." +
-         std::to_string(generation);
-}
 
 struct View {
   kernel::SlotRef ref;
@@ -60,12 +57,38 @@ Views& GetViews() {
   return *g_views;
 }
 
+// Gives the pages of an arena range back (they read as zero afterwards).
+void ReleaseRange(std::uint64_t offset, std::uint64_t length) {
+  static_cast<void>(fallocate(kernel::RegionFd(), FALLOC_FL_PUNCH_HOLE | FALLOC_FL_KEEP_SIZE,
+                              static_cast<off_t>(kernel::kArenaOffset + offset),
+                              static_cast<off_t>(length)));
+}
+
+// First fit among the ranges of the other mappings; false when full.
+bool AllocateRange(const kernel::Slot& self, std::uint64_t length, std::uint64_t* offset) {
+  std::vector<std::pair<std::uint64_t, std::uint64_t>> used;
+  for (const kernel::Slot& slot : kernel::GetRegion().slots) {
+    if (&slot != &self && slot.kind == kernel::kMapping && slot.arenaLength != 0) {
+      used.emplace_back(slot.arenaOffset, slot.arenaLength);
+    }
+  }
+  std::sort(used.begin(), used.end());
+  std::uint64_t at = 0;
+  for (const auto& range : used) {
+    if (range.first >= at + length) break;
+    at = std::max(at, range.first + range.second);
+  }
+  if (at + length > kernel::kArenaBytes) return false;
+  *offset = at;
+  return true;
+}
+
 }  // namespace
 
 namespace kernel {
 
-void MappingSlotFreed(std::uint32_t index, std::uint32_t generation) {
-  unlink(MappingPath(index, generation).c_str());
+void MappingSlotFreed(const Slot& slot) {
+  if (slot.arenaLength != 0) ReleaseRange(slot.arenaOffset, slot.arenaLength);
 }
 
 }  // namespace kernel
@@ -88,12 +111,16 @@ HANDLE CreateFileMappingW(HANDLE file, LPSECURITY_ATTRIBUTES /*attributes*/, DWO
   HANDLE handle = emu::CreateSlotHandle(
       emu::kernel::kMapping, name,
       [&](emu::kernel::Slot& slot) {
+        std::uint64_t length = (size + emu::kAllocationGranularity - 1) /
+                               emu::kAllocationGranularity * emu::kAllocationGranularity;
+        std::uint64_t offset = 0;
+        if (!emu::AllocateRange(slot, length, &offset)) {
+          failed = true;
+          return;
+        }
         slot.mappingSize = size;
-        std::uint32_t index = static_cast<std::uint32_t>(&slot - emu::kernel::GetRegion().slots);
-        std::string path = emu::MappingPath(index, slot.generation);
-        int fd = open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
-        if (fd < 0 || ftruncate(fd, static_cast<off_t>(size)) != 0) failed = true;
-        if (fd >= 0) close(fd);
+        slot.arenaOffset = offset;
+        slot.arenaLength = length;
       },
       access == PAGE_READONLY ? FILE_MAP_READ : FILE_MAP_ALL_ACCESS);
   if (handle != nullptr && failed) {
@@ -144,16 +171,10 @@ LPVOID MapViewOfFile(HANDLE mapping, DWORD desiredAccess, DWORD fileOffsetHigh, 
   }
   std::size_t length =
       numberOfBytesToMap == 0 ? static_cast<std::size_t>(size - offset) : numberOfBytesToMap;
-  std::string path = emu::MappingPath(object->Ref().index, object->Ref().generation);
-  int fd = open(path.c_str(), O_RDWR | O_CLOEXEC);
-  if (fd < 0) {
-    SetLastError(ERROR_NOT_ENOUGH_MEMORY);
-    return nullptr;
-  }
   int protection = write || copy ? PROT_READ | PROT_WRITE : PROT_READ;
-  void* view = mmap(nullptr, length, protection, copy ? MAP_PRIVATE : MAP_SHARED, fd,
-                    static_cast<off_t>(offset));
-  close(fd);
+  void* view = mmap(nullptr, length, protection, copy ? MAP_PRIVATE : MAP_SHARED,
+                    emu::kernel::RegionFd(),
+                    static_cast<off_t>(emu::kernel::kArenaOffset + slot->arenaOffset + offset));
   if (view == MAP_FAILED) {
     SetLastError(ERROR_NOT_ENOUGH_MEMORY);
     return nullptr;

@@ -91,7 +91,10 @@ void StartOverlapped(OVERLAPPED* overlapped, const std::shared_ptr<SlotObject>& 
   if (event != nullptr) {
     kernel::Lock lock;
     kernel::Slot* slot = kernel::SlotOf(event->Ref());
-    if (slot != nullptr) slot->signaled = 0;
+    if (slot != nullptr) {
+      kernel::Touch(slot->signaled);
+      slot->signaled = 0;
+    }
   }
 }
 
@@ -111,8 +114,9 @@ void SignalEventLocked(const std::shared_ptr<SlotObject>& event) {
   if (event == nullptr) return;
   kernel::Slot* slot = kernel::SlotOf(event->Ref());
   if (slot == nullptr) return;
+  kernel::Touch(slot->signaled);
   slot->signaled = 1;
-  kernel::Broadcast();
+  kernel::Notify(kernel::SlotKey(event->Ref().index));
 }
 
 void SignalEvent(const std::shared_ptr<SlotObject>& event) {

@@ -1,11 +1,14 @@
 // Named pipes. Each instance lives in the shared kernel region with one
 // message queue per direction; every process keeps the list of its own
 // requests that wait for the other end (a read with no data, a write that
-// does not fit, a connect with no client yet). A request is retried on every
-// change of kernel state, in issue order, by the thread that waits for it
-// (synchronous handles) or by this process's I/O service thread (overlapped
-// requests), which copies the data, stores the OVERLAPPED status and
-// signals the event. All of it is guarded by the kernel lock.
+// does not fit, a connect with no client yet). A request is retried, in
+// issue order, whenever its instance changes, by the thread that waits for
+// it (synchronous handles) or by this process's I/O service thread
+// (overlapped requests), which copies the data, stores the OVERLAPPED status
+// and signals the event. All of it is guarded by the kernel lock; every
+// change of an instance notifies its key, and a change of what listens
+// notifies the pipe-names key (WaitNamedPipeW). The processes at the other
+// ends are watched, so an end whose process died is closed on its behalf.
 #include "platform/posix/pipes.h"
 
 #include <pthread.h>
@@ -38,6 +41,7 @@ struct Ring {
 };
 
 void QueueClear(PipeQueue& q) {
+  kernel::Touch(q);
   q.readPos = 0;
   q.usedBytes = 0;
   q.messages = 0;
@@ -68,9 +72,23 @@ bool QueueFits(const Ring& r, DWORD length) {
   return static_cast<std::uint64_t>(r.q->usedBytes) + kHeader + length <= kCapacity;
 }
 
+// The ring bytes a push will write. They lie past the queue's data, so they
+// need saving only when this lock hold has already changed the queue: a
+// message read in it may have freed them, and a rollback brings it back.
+void SaveRingBytes(const Ring& r, std::uint32_t offset, std::uint32_t n) {
+  if (!kernel::Journalled(r.q)) return;
+  std::uint32_t pos = (r.q->readPos + offset) % kCapacity;
+  std::uint32_t first = n < kCapacity - pos ? n : kCapacity - pos;
+  kernel::Save(r.data + pos, first);
+  if (n > first) kernel::Save(r.data, n - first);
+}
+
 void QueuePush(const Ring& r, const void* data, std::uint32_t length) {
+  SaveRingBytes(r, r.q->usedBytes, kHeader + length);
+  kernel::Touch(*r.q);
   RingWrite(r, r.q->usedBytes, &length, kHeader);
   if (length != 0) RingWrite(r, r.q->usedBytes + kHeader, data, length);
+  kernel::CrashPoint("pipe-push");
   r.q->usedBytes += kHeader + length;
   ++r.q->messages;
 }
@@ -106,6 +124,7 @@ void QueueAvailable(const Ring& r, DWORD* total, DWORD* leftInMessage) {
 DWORD QueueRead(const Ring& ring, bool messageMode, void* buffer, DWORD length, DWORD* bytes,
                 bool consume) {
   auto* out = static_cast<std::uint8_t*>(buffer);
+  if (consume) kernel::Touch(*ring.q);
   PipeQueue copy = *ring.q;
   Ring r{consume ? ring.q : &copy, ring.data};
   *bytes = 0;
@@ -162,8 +181,19 @@ bool NameEqual(const WCHAR* a, const WCHAR* b) {
 
 // ---- Instances ---------------------------------------------------------------
 
+std::uint32_t IndexOf(const PipeInstance& inst) {
+  return static_cast<std::uint32_t>(&inst - kernel::GetRegion().pipes);
+}
+
+// Wakes the waiters of `inst`, and WaitNamedPipeW callers.
+void Changed(const PipeInstance& inst) {
+  kernel::Notify(kernel::PipeKey(IndexOf(inst)));
+  kernel::Notify(kernel::kPipeNamesKey);
+}
+
 void MaybeFree(PipeInstance& inst) {
   if (inst.serverOpen != 0 || inst.clientOpen != 0) return;
+  kernel::Touch(inst);
   std::uint32_t next = inst.generation + 1;
   inst.inUse = 0;
   inst.name[0] = 0;
@@ -173,24 +203,36 @@ void MaybeFree(PipeInstance& inst) {
   inst.generation = next;
 }
 
-// Ends held by processes that died are closed on their behalf.
+void CloseServerEnd(PipeInstance& inst) {
+  kernel::Touch(inst);
+  inst.serverOpen = 0;
+  QueueClear(inst.toServer);
+}
+
+void CloseClientEnd(PipeInstance& inst) {
+  kernel::Touch(inst);
+  inst.clientOpen = 0;
+  if (inst.state == kernel::kPipeConnected) inst.state = kernel::kPipeClosing;
+  QueueClear(inst.toClient);
+}
+
+// Ends held by processes that died are closed on their behalf. Asking
+// starts watching the other processes, so a later death closes their ends
+// without anyone having to look.
 void RefreshPeers(PipeInstance& inst) {
   if (inst.inUse == 0) return;
   bool changed = false;
   if (inst.serverOpen != 0 && !kernel::ProcessAlive(inst.server)) {
-    inst.serverOpen = 0;
-    QueueClear(inst.toServer);
+    CloseServerEnd(inst);
     changed = true;
   }
   if (inst.clientOpen != 0 && !kernel::ProcessAlive(inst.client)) {
-    inst.clientOpen = 0;
-    if (inst.state == kernel::kPipeConnected) inst.state = kernel::kPipeClosing;
-    QueueClear(inst.toClient);
+    CloseClientEnd(inst);
     changed = true;
   }
   if (changed) {
+    Changed(inst);
     MaybeFree(inst);
-    kernel::Broadcast();
   }
 }
 
@@ -259,6 +301,8 @@ class PipeEnd : public FileObject, public std::enable_shared_from_this<PipeEnd> 
         canRead_(canRead),
         canWrite_(canWrite),
         canSetState_(canSetState) {}
+
+  std::uint32_t Index() const { return index_; }
 
   // The instance, while this end still refers to it (kernel lock held).
   PipeInstance* Instance() const {
@@ -351,13 +395,14 @@ class PipeEnd : public FileObject, public std::enable_shared_from_this<PipeEnd> 
 
 namespace {
 
+std::uint32_t ProcessKey() {
+  return kernel::kProcessKeyBase + static_cast<std::uint32_t>(kernel::Self().pid);
+}
+
 // Runs every waiting request of this process that can now finish, in issue
 // order (a read or write waits behind an earlier one of the same end).
-void ProgressAll(bool checkPeers) {
+void ProgressAll() {
   Process& process = GetProcess();
-  if (checkPeers) {
-    for (PipeInstance& inst : kernel::GetRegion().pipes) RefreshPeers(inst);
-  }
   std::vector<std::pair<const PipeEnd*, PipeOp::Kind>> blocked;
   for (auto it = process.ops.begin(); it != process.ops.end();) {
     PipeOp& op = **it;
@@ -378,41 +423,70 @@ void ProgressAll(bool checkPeers) {
     } else {
       StoreOverlappedLocked(op.overlapped, op.event, error, bytes);
     }
+    // The request's own thread, and a request queued behind this one.
+    kernel::Notify(kernel::PipeKey(op.end->Index()));
     it = process.ops.erase(it);
-    kernel::Broadcast();
   }
 }
 
-// Waits for changes and progresses requests until `done` holds (kernel lock
-// held). Ends of processes that died are looked for at the liveness poll
-// interval, however busy the namespace is.
+// The keys a wait sleeps on: the instance of `end`, or for the service
+// thread (`end` null) its own key, which a new overlapped request notifies,
+// and the instances of this process's overlapped requests. The processes at
+// the other ends are looked at first, which also starts watching them.
+std::uint32_t KeysToWaitOn(const PipeEnd* end, std::uint32_t* keys) {
+  kernel::Region& region = kernel::GetRegion();
+  if (end != nullptr) {
+    RefreshPeers(region.pipes[end->Index()]);
+    keys[0] = kernel::PipeKey(end->Index());
+    return 1;
+  }
+  std::uint32_t count = 0;
+  keys[count++] = ProcessKey();
+  for (const auto& op : GetProcess().ops) {
+    if (op->synchronous) continue;
+    std::uint32_t key = kernel::PipeKey(op->end->Index());
+    bool known = false;
+    for (std::uint32_t k = 0; k < count; ++k) known = known || keys[k] == key;
+    if (known) continue;
+    RefreshPeers(region.pipes[op->end->Index()]);
+    if (count < kernel::kMaxWaitKeys) keys[count++] = key;
+  }
+  return count;
+}
+
+// Progresses requests until `done` holds (kernel lock held), sleeping
+// until the instance of `end` (null: of any overlapped request) changes.
 template <class Done>
-void WaitProgress(Done done) {
-  constexpr std::int64_t kPollNs = kernel::kLivenessPollMs * 1000000LL;
-  std::int64_t lastCheck = kernel::NowNs();
+void WaitProgress(const PipeEnd* end, Done done) {
+  std::uint32_t keys[kernel::kMaxWaitKeys];
   for (;;) {
-    std::int64_t now = kernel::NowNs();
-    bool checkPeers = now - lastCheck >= kPollNs;
-    if (checkPeers) lastCheck = now;
-    ProgressAll(checkPeers);
+    ProgressAll();
     if (done()) return;
-    kernel::WaitChange(-1, kernel::kLivenessPollMs);
+    std::uint32_t count = KeysToWaitOn(end, keys);
+    // A peer found dead just now changed an instance: look again first.
+    ProgressAll();
+    if (done()) return;
+    kernel::WaitKeys(keys, count, -1);
   }
 }
 
 void* ServiceThread(void*) {
   kernel::Lock lock;
-  WaitProgress([] { return false; });
+  WaitProgress(nullptr, [] { return false; });
   return nullptr;
 }
 
 void EnsureServiceThread() {
   Process& process = GetProcess();
-  if (process.serviceRunning) return;
+  if (process.serviceRunning) {
+    kernel::Notify(ProcessKey());
+    return;
+  }
   pthread_t thread;
   pthread_attr_t attr;
   pthread_attr_init(&attr);
   pthread_attr_setdetachstate(&attr, PTHREAD_CREATE_DETACHED);
+  pthread_attr_setstacksize(&attr, 256 * 1024);
   if (pthread_create(&thread, &attr, ServiceThread, nullptr) == 0) process.serviceRunning = true;
   pthread_attr_destroy(&attr);
 }
@@ -469,7 +543,7 @@ bool PipeEnd::Attempt(PipeOp& op, DWORD* error, DWORD* bytes) {
       bool drainable = link == ERROR_SUCCESS || link == ERROR_BROKEN_PIPE;
       if (drainable && queue.q->messages != 0) {
         *error = QueueRead(queue, messageRead_, op.readBuffer, op.length, bytes, true);
-        kernel::Broadcast();
+        kernel::Notify(kernel::PipeKey(index_));
         return true;
       }
       if (link != ERROR_SUCCESS) {
@@ -498,7 +572,7 @@ bool PipeEnd::Attempt(PipeOp& op, DWORD* error, DWORD* bytes) {
       QueuePush(queue, op.writeBuffer, op.length);
       *bytes = op.length;
       *error = ERROR_SUCCESS;
-      kernel::Broadcast();
+      kernel::Notify(kernel::PipeKey(index_));
       return true;
     }
   }
@@ -543,8 +617,9 @@ BOOL PipeEnd::Issue(PipeOp::Kind kind, void* readBuffer, const void* writeBuffer
           error = ERROR_NO_DATA;
         } else {
           if (inst->state == kernel::kPipeDisconnected) {
+            kernel::Touch(inst->state);
             inst->state = kernel::kPipeListening;
-            kernel::Broadcast();
+            Changed(*inst);
           }
           finished = false;
         }
@@ -567,7 +642,7 @@ BOOL PipeEnd::Issue(PipeOp::Kind kind, void* readBuffer, const void* writeBuffer
           SetLastError(ERROR_IO_PENDING);
           return FALSE;
         }
-        WaitProgress([&] { return op->finished; });
+        WaitProgress(this, [&] { return op->finished; });
         error = op->error;
         bytes = op->bytes;
       }
@@ -604,14 +679,14 @@ int PipeEnd::Cancel(std::int32_t threadId, OVERLAPPED* overlapped) {
     StoreOverlappedLocked(op.overlapped, op.event, ERROR_OPERATION_ABORTED, 0);
     it = ops.erase(it);
   }
-  kernel::Broadcast();
+  kernel::Notify(kernel::PipeKey(index_));
   return count;
 }
 
 BOOL PipeEnd::Flush() {
   kernel::Lock lock;
   DWORD error = ERROR_SUCCESS;
-  WaitProgress([&] {
+  WaitProgress(this, [&] {
     PipeInstance* inst = Instance();
     if (inst == nullptr) {
       error = ERROR_PIPE_NOT_CONNECTED;
@@ -636,6 +711,7 @@ void PipeEnd::HandleClosed() {
   closed_ = true;
   PipeInstance* inst = Instance();
   if (inst != nullptr) {
+    kernel::Touch(*inst);
     if (server_) {
       inst->serverOpen = 0;
       QueueClear(inst->toServer);
@@ -646,11 +722,12 @@ void PipeEnd::HandleClosed() {
         QueueClear(inst->toClient);
       }
     }
+    Changed(*inst);
     MaybeFree(*inst);
   }
   // Requests still waiting on this handle end as cancelled.
-  ProgressAll(false);
-  kernel::Broadcast();
+  ProgressAll();
+  kernel::Notify(kernel::PipeKey(index_));
 }
 
 BOOL PipeEnd::Disconnect() {
@@ -664,11 +741,12 @@ BOOL PipeEnd::Disconnect() {
     SetLastError(ERROR_PIPE_NOT_CONNECTED);
     return FALSE;
   }
+  kernel::Touch(*inst);
   QueueClear(inst->toClient);
   QueueClear(inst->toServer);
   inst->state = kernel::kPipeDisconnected;
-  ProgressAll(false);
-  kernel::Broadcast();
+  Changed(*inst);
+  ProgressAll();
   return TRUE;
 }
 
@@ -763,6 +841,7 @@ HANDLE OpenPipeClient(const WCHAR* name, DWORD access, DWORD flags) {
       return INVALID_HANDLE_VALUE;
     }
     PipeInstance& inst = region.pipes[chosen];
+    kernel::Touch(inst);
     QueueClear(inst.toClient);
     QueueClear(inst.toServer);
     inst.state = kernel::kPipeConnected;
@@ -773,8 +852,8 @@ HANDLE OpenPipeClient(const WCHAR* name, DWORD access, DWORD flags) {
     generation = inst.generation;
     connection = inst.connection;
     message = false;  // clients start in byte read mode
-    ProgressAll(false);
-    kernel::Broadcast();
+    Changed(inst);
+    ProgressAll();
   }
   bool all = (access & GENERIC_ALL) != 0;
   bool canRead = all || (access & (GENERIC_READ | FILE_READ_DATA)) != 0;
@@ -787,6 +866,29 @@ HANDLE OpenPipeClient(const WCHAR* name, DWORD access, DWORD flags) {
   SetLastError(ERROR_SUCCESS);
   return handle;
 }
+
+namespace kernel {
+
+void ClosePipeEndsOfProcess(const ProcessId& process) {
+  for (PipeInstance& inst : GetRegion().pipes) {
+    if (inst.inUse == 0) continue;
+    bool changed = false;
+    if (inst.serverOpen != 0 && SameProcess(inst.server, process)) {
+      CloseServerEnd(inst);
+      changed = true;
+    }
+    if (inst.clientOpen != 0 && SameProcess(inst.client, process)) {
+      CloseClientEnd(inst);
+      changed = true;
+    }
+    if (changed) {
+      Changed(inst);
+      MaybeFree(inst);
+    }
+  }
+}
+
+}  // namespace kernel
 
 namespace {
 
@@ -848,6 +950,7 @@ HANDLE CreateNamedPipeW(LPCWSTR name, DWORD openMode, DWORD pipeMode, DWORD maxI
       return INVALID_HANDLE_VALUE;
     }
     emu::kernel::PipeInstance& inst = region.pipes[free];
+    emu::kernel::Touch(inst);
     std::uint32_t keepGeneration = inst.generation;
     std::uint32_t keepConnection = inst.connection;
     inst.inUse = 1;
@@ -867,7 +970,7 @@ HANDLE CreateNamedPipeW(LPCWSTR name, DWORD openMode, DWORD pipeMode, DWORD maxI
     emu::QueueClear(inst.toServer);
     index = static_cast<std::uint32_t>(free);
     generation = inst.generation;
-    emu::kernel::Broadcast();
+    emu::Changed(inst);
   }
   auto end = std::make_shared<emu::PipeEnd>(
       true, index, generation, 0, (openMode & FILE_FLAG_OVERLAPPED) != 0, messageRead,
@@ -928,7 +1031,8 @@ BOOL WaitNamedPipeW(LPCWSTR namedPipeName, DWORD timeOut) {
       SetLastError(ERROR_SEM_TIMEOUT);
       return FALSE;
     }
-    emu::kernel::WaitChange(deadline, emu::kernel::kLivenessPollMs);
+    const std::uint32_t key = emu::kernel::kPipeNamesKey;
+    emu::kernel::WaitKeys(&key, 1, deadline);
   }
 }
 

@@ -15,7 +15,6 @@ using kernel::SlotRef;
 SlotObject::~SlotObject() {
   kernel::Lock lock;
   kernel::DropHolder(ref_);
-  kernel::Broadcast();
 }
 
 std::shared_ptr<SlotObject> LookupSlotObject(HANDLE handle, SlotKind kind) {
@@ -56,7 +55,6 @@ HANDLE CreateSlotHandle(SlotKind kind, LPCWSTR name, const std::function<void(Sl
         return nullptr;
       }
       initialise(*kernel::SlotOf(ref));
-      kernel::Broadcast();
     }
   }
   HANDLE handle = AllocateHandle(std::make_shared<SlotObject>(kind, ref, access));
@@ -96,20 +94,32 @@ HANDLE OpenSlotHandle(SlotKind kind, LPCWSTR name, DWORD access) {
 
 namespace {
 
+std::uint32_t KeyOf(const Slot& slot) {
+  return kernel::SlotKey(static_cast<std::uint32_t>(&slot - kernel::GetRegion().slots));
+}
+
+// The mutex is free again: marked abandoned, and its waiters woken.
+void Abandon(Slot& slot) {
+  kernel::Touch(slot);
+  slot.ownerThread = 0;
+  slot.ownerProcess = kernel::ProcessId{};
+  slot.recursion = 0;
+  slot.abandoned = 1;
+  kernel::Notify(KeyOf(slot));
+}
+
 bool OwnedByCaller(const Slot& slot) {
   return slot.ownerThread != 0 && slot.ownerThread == kernel::ThreadId() &&
          kernel::SameProcess(slot.ownerProcess, kernel::Self());
 }
 
 // A mutex whose owner process has died is abandoned (threads of this process
-// abandon their mutexes themselves when they end).
+// abandon their mutexes themselves when they end). Asking starts watching
+// the owner, so a wait on the mutex is woken if it dies later.
 void CheckMutexOwner(Slot& slot) {
   if (slot.ownerThread == 0 || kernel::SameProcess(slot.ownerProcess, kernel::Self())) return;
   if (kernel::ProcessAlive(slot.ownerProcess)) return;
-  slot.ownerThread = 0;
-  slot.ownerProcess = kernel::ProcessId{};
-  slot.recursion = 0;
-  slot.abandoned = 1;
+  Abandon(slot);
 }
 
 bool Signaled(const Slot& slot) {
@@ -141,10 +151,14 @@ thread_local OwnerExitHook t_ownerExitHook;
 
 bool Acquire(Slot& slot) {
   if (slot.kind == kernel::kEvent) {
-    if (slot.manualReset == 0) slot.signaled = 0;
+    if (slot.manualReset == 0) {
+      kernel::Touch(slot.signaled);
+      slot.signaled = 0;
+    }
     return false;
   }
   if (slot.kind != kernel::kMutex) return false;
+  kernel::Touch(slot);
   if (slot.ownerThread == 0) {
     slot.ownerThread = kernel::ThreadId();
     slot.ownerProcess = kernel::Self();
@@ -167,19 +181,22 @@ HANDLE const kPseudoThread = reinterpret_cast<HANDLE>(static_cast<LONG_PTR>(-2))
 }  // namespace
 
 void AbandonMutexesOfThread(std::int32_t threadId) {
-  kernel::Region& region = kernel::GetRegion();
-  bool changed = false;
-  for (Slot& slot : region.slots) {
+  for (Slot& slot : kernel::GetRegion().slots) {
     if (slot.kind != kernel::kMutex || slot.ownerThread != threadId) continue;
-    if (!kernel::SameProcess(slot.ownerProcess, kernel::Self())) continue;
-    slot.ownerThread = 0;
-    slot.ownerProcess = kernel::ProcessId{};
-    slot.recursion = 0;
-    slot.abandoned = 1;
-    changed = true;
+    if (kernel::SameProcess(slot.ownerProcess, kernel::Self())) Abandon(slot);
   }
-  if (changed) kernel::Broadcast();
 }
+
+namespace kernel {
+
+void AbandonMutexesOfProcess(const ProcessId& process) {
+  for (Slot& slot : GetRegion().slots) {
+    if (slot.kind != kMutex || slot.ownerThread == 0) continue;
+    if (SameProcess(slot.ownerProcess, process)) Abandon(slot);
+  }
+}
+
+}  // namespace kernel
 
 }  // namespace emu
 
@@ -208,8 +225,9 @@ BOOL SetEventState(HANDLE event, std::uint32_t state) {
     SetLastError(ERROR_INVALID_HANDLE);
     return FALSE;
   }
+  emu::kernel::Touch(slot->signaled);
   slot->signaled = state;
-  if (state != 0) emu::kernel::Broadcast();
+  if (state != 0) emu::kernel::Notify(emu::KeyOf(*slot));
   return TRUE;
 }
 
@@ -245,10 +263,11 @@ BOOL ReleaseMutex(HANDLE mutex) {
     SetLastError(ERROR_NOT_OWNER);
     return FALSE;
   }
+  emu::kernel::Touch(*slot);
   if (--slot->recursion == 0) {
     slot->ownerThread = 0;
     slot->ownerProcess = emu::kernel::ProcessId{};
-    emu::kernel::Broadcast();
+    emu::kernel::Notify(emu::KeyOf(*slot));
   }
   return TRUE;
 }
@@ -263,7 +282,7 @@ DWORD WaitForMultipleObjects(DWORD count, const HANDLE* handles, BOOL waitAll, D
     return WAIT_FAILED;
   }
   std::shared_ptr<emu::SlotObject> objects[MAXIMUM_WAIT_OBJECTS];
-  bool watchOtherProcesses = false;
+  std::uint32_t keys[MAXIMUM_WAIT_OBJECTS];
   for (DWORD i = 0; i < count; ++i) {
     if (handles[i] == emu::kPseudoThread) {
       // The calling thread never ends while it waits on itself.
@@ -275,7 +294,7 @@ DWORD WaitForMultipleObjects(DWORD count, const HANDLE* handles, BOOL waitAll, D
       SetLastError(ERROR_INVALID_HANDLE);
       return WAIT_FAILED;
     }
-    if (objects[i]->Kind() == emu::kernel::kMutex) watchOtherProcesses = true;
+    keys[i] = emu::kernel::SlotKey(objects[i]->Ref().index);
     if (waitAll) {
       for (DWORD k = 0; k < i; ++k) {
         if (objects[k]->Ref().index == objects[i]->Ref().index) {
@@ -315,6 +334,6 @@ DWORD WaitForMultipleObjects(DWORD count, const HANDLE* handles, BOOL waitAll, D
     }
     // Checked after the look above, so a change that raced the time-out counts.
     if (deadline >= 0 && emu::kernel::NowNs() >= deadline) return WAIT_TIMEOUT;
-    emu::kernel::WaitChange(deadline, watchOtherProcesses ? emu::kernel::kLivenessPollMs : 1000);
+    emu::kernel::WaitKeys(keys, count, deadline);
   }
 }

@@ -42,11 +42,12 @@ struct ThreadFinisher {
       g_runningThreads.fetch_sub(1);
       kernel::Slot* slot = kernel::SlotOf(start->ref);
       if (slot != nullptr) {
+        kernel::Touch(*slot);
         slot->exitCode = start->exitCode;
         slot->signaled = 1;
+        kernel::Notify(kernel::SlotKey(start->ref.index));
       }
       kernel::DropHolder(start->ref);
-      kernel::Broadcast();
     }
     t_current = nullptr;
   }
