@@ -4,10 +4,12 @@
 // creation, WaitNamedPipeW and TransactNamedPipe.
 #include <gtest/gtest.h>
 
+#include <cstdlib>
 #include <string>
 #include <vector>
 
 #include "pipe_helpers.h"
+#include "support/child_process.h"
 
 namespace {
 
@@ -252,18 +254,47 @@ TEST(Pipe, ClientClosingBreaksTheServersReads) {
   EXPECT_EQ(ReadServer(server.Get(), text), ERROR_BROKEN_PIPE);
 }
 
-TEST(Pipe, MessageWrittenBeforeTheClientClosedIsStillRead) {
+// A client process that ends without closing its handle: the system closes
+// it, what it wrote is still read, a pending read breaks and a write finds
+// the pipe closing.
+TEST(Pipe, ClientProcessEndingClosesItsEnd) {
   WideString name = PipeName();
+  if (skytest::ChildRole() != nullptr) {
+    Handle client = OpenClient(name);
+    ASSERT_TRUE(client);
+    ASSERT_TRUE(WriteMessage(client.Get(), "last words"));
+    static_cast<void>(client.Release());
+    std::_Exit(0);
+  }
   Handle server = CreateServer(name);
   ASSERT_TRUE(server);
-  Handle client = OpenClient(name);
-  ASSERT_TRUE(client);
-  ASSERT_TRUE(WriteMessage(client.Get(), "last words"));
-  client.Reset();
+  Overlapped connect;
+  ASSERT_FALSE(ConnectNamedPipe(server.Get(), connect.Get()));
+  ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
+  skytest::ChildProcess child;
+  ASSERT_TRUE(child.Start("client"));
+  DWORD bytes = 0;
+  ASSERT_TRUE(GetOverlappedResult(server.Get(), connect.Get(), &bytes, TRUE));
   std::string text;
   EXPECT_EQ(ReadServer(server.Get(), text), 0u);
   EXPECT_EQ(text, "last words");
+
+  Overlapped read;
+  char buffer[64] = {};
+  SetLastError(0);
+  EXPECT_FALSE(ReadFile(server.Get(), buffer, sizeof(buffer), &bytes, read.Get()));
+  DWORD error = GetLastError();
+  ASSERT_EQ(child.Wait(skytest::kProcessGuardMs), 0);
+  if (error == ERROR_IO_PENDING) {
+    EXPECT_FALSE(GetOverlappedResult(server.Get(), read.Get(), &bytes, TRUE));
+    error = GetLastError();
+  }
+  EXPECT_EQ(error, ERROR_BROKEN_PIPE);
   EXPECT_EQ(ReadServer(server.Get(), text), ERROR_BROKEN_PIPE);
+  Overlapped write;
+  SetLastError(0);
+  EXPECT_FALSE(WriteFile(server.Get(), "late", 4, &bytes, write.Get()));
+  EXPECT_EQ(GetLastError(), ERROR_NO_DATA);
 }
 
 TEST(Pipe, ServerDisconnectEndsTheClientAndTheInstanceServesTheNext) {

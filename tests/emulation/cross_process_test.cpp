@@ -31,32 +31,6 @@ TEST(CrossProcess, NamedEventSetByChildReleasesWaiter) {
   CloseHandle(ready);
 }
 
-TEST(CrossProcess, MutexOfKilledProcessIsAbandoned) {
-  HANDLE owned = CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuXpOwned"));
-  HANDLE mutex = CreateMutexW(nullptr, FALSE, WSTR("Global\\EmuXpMutex"));
-  ASSERT_NE(mutex, nullptr);
-  pid_t child = Fork([] {
-    HANDLE m = OpenMutexW(MUTEX_ALL_ACCESS, FALSE, WSTR("Global\\EmuXpMutex"));
-    HANDLE o = OpenEventW(EVENT_ALL_ACCESS, FALSE, WSTR("Global\\EmuXpOwned"));
-    if (m == nullptr || o == nullptr) return 10;
-    if (WaitForSingleObject(m, 0) != WAIT_OBJECT_0) return 11;
-    SetEvent(o);
-    for (;;) pause();  // killed while it owns the mutex
-  });
-  ASSERT_EQ(WaitForSingleObject(owned, 10000), WAIT_OBJECT_0);
-  EXPECT_EQ(WaitForSingleObject(mutex, 0), WAIT_TIMEOUT);
-  kill(child, SIGKILL);
-  EXPECT_EQ(ExitCodeOf(child), 128 + SIGKILL);
-  HANDLE pair[2] = {owned, mutex};
-  ResetEvent(owned);
-  EXPECT_EQ(WaitForMultipleObjects(2, pair, FALSE, 10000), WAIT_ABANDONED_0 + 1);
-  EXPECT_TRUE(ReleaseMutex(mutex));
-  EXPECT_EQ(WaitForSingleObject(mutex, 0), WAIT_OBJECT_0);
-  EXPECT_TRUE(ReleaseMutex(mutex));
-  CloseHandle(mutex);
-  CloseHandle(owned);
-}
-
 TEST(CrossProcess, MappingContentAndLifetime) {
   constexpr DWORD kSize = 1215512;
   HANDLE mapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0, kSize,

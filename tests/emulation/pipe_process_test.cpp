@@ -8,6 +8,7 @@
 #include <cstring>
 
 #include "fork_child.h"
+#include "platform/posix/kernel.h"
 #include "platform/win32.h"
 
 namespace {
@@ -38,79 +39,133 @@ int ClientExchange() {
   return CloseHandle(pipe) ? 0 : 25;
 }
 
+// Waits for the overlapped request on `ov` to finish; its result and count.
+bool Finish(HANDLE server, OVERLAPPED* ov, BOOL started, DWORD* bytes) {
+  if (!started && GetLastError() != ERROR_IO_PENDING) return false;
+  if (WaitForSingleObject(ov->hEvent, 10000) != WAIT_OBJECT_0) return false;
+  return GetOverlappedResult(server, ov, bytes, FALSE) != FALSE;
+}
+
+// Serves one client process's "ping" with "pong!" on a listening instance;
+// the next read then finds the pipe broken.
+void ServeOneExchange(HANDLE server, OVERLAPPED* ov) {
+  pid_t child = Fork(ClientExchange);
+  DWORD bytes = 0;
+  BOOL connected = ConnectNamedPipe(server, ov);
+  if (!connected && GetLastError() == ERROR_PIPE_CONNECTED) {
+    connected = TRUE;
+  } else {
+    ASSERT_TRUE(Finish(server, ov, connected, &bytes));
+  }
+  char request[16] = {};
+  ASSERT_TRUE(Finish(server, ov, ReadFile(server, request, sizeof(request), &bytes, ov), &bytes));
+  EXPECT_EQ(bytes, 4u);
+  EXPECT_EQ(std::memcmp(request, "ping", 4), 0);
+  ASSERT_TRUE(Finish(server, ov, WriteFile(server, "pong!", 5, &bytes, ov), &bytes));
+  EXPECT_EQ(bytes, 5u);
+  EXPECT_EQ(ExitCodeOf(child), 0);
+  EXPECT_FALSE(Finish(server, ov, ReadFile(server, request, sizeof(request), &bytes, ov), &bytes));
+  EXPECT_EQ(GetLastError(), ERROR_BROKEN_PIPE);
+  EXPECT_TRUE(DisconnectNamedPipe(server));
+}
+
 TEST(PipeProcesses, OverlappedServerIsCompletedByAClientProcess) {
   HANDLE server = CreateServer();
   ASSERT_NE(server, INVALID_HANDLE_VALUE);
   HANDLE event = CreateEventW(nullptr, TRUE, FALSE, nullptr);
   OVERLAPPED ov{};
   ov.hEvent = event;
-  EXPECT_FALSE(ConnectNamedPipe(server, &ov));
-  ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
-
-  pid_t child = Fork(ClientExchange);
-  ASSERT_EQ(WaitForSingleObject(event, 10000), WAIT_OBJECT_0);
-  DWORD bytes = 0;
-  EXPECT_TRUE(GetOverlappedResult(server, &ov, &bytes, FALSE));
-
-  char request[16] = {};
-  if (!ReadFile(server, request, sizeof(request), &bytes, &ov)) {
-    ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
-    ASSERT_EQ(WaitForSingleObject(event, 10000), WAIT_OBJECT_0);
-    ASSERT_TRUE(GetOverlappedResult(server, &ov, &bytes, FALSE));
-  }
-  EXPECT_EQ(bytes, 4u);
-  EXPECT_EQ(std::memcmp(request, "ping", 4), 0);
-  if (!WriteFile(server, "pong!", 5, &bytes, &ov)) {
-    ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
-    ASSERT_TRUE(GetOverlappedResult(server, &ov, &bytes, TRUE));
-  }
-  EXPECT_EQ(bytes, 5u);
-  EXPECT_EQ(ExitCodeOf(child), 0);
-  // The client has gone: the next read ends with a broken pipe.
-  EXPECT_FALSE(ReadFile(server, request, sizeof(request), &bytes, &ov));
-  EXPECT_EQ(GetLastError(), ERROR_BROKEN_PIPE);
-  EXPECT_TRUE(DisconnectNamedPipe(server));
+  ServeOneExchange(server, &ov);
+  ServeOneExchange(server, &ov);
   CloseHandle(event);
   CloseHandle(server);
 }
 
-TEST(PipeProcesses, KilledClientBreaksThePendingServerRead) {
+// A client process killed at any moment, even inside the kernel lock, leaves
+// the server's process working as on Windows: its pipe end is closed (the
+// pending read breaks), a mutex it owned is abandoned, a change it left
+// half made is undone, and the instance serves the next client.
+enum class KillPoint { kInWrite, kInRead, kInWait, kOwningMutex, kInsideKernelLock };
+
+class KilledClient : public ::testing::TestWithParam<KillPoint> {};
+
+int ClientUntilKilled(KillPoint point) {
+  HANDLE pipe =
+      CreateFileW(kPipe, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr);
+  HANDLE up = OpenEventW(EVENT_MODIFY_STATE, FALSE, u"Global\\EmuKillUp");
+  HANDLE idle = OpenEventW(SYNCHRONIZE | EVENT_MODIFY_STATE, FALSE, u"Global\\EmuKillIdle");
+  HANDLE mutex = OpenMutexW(SYNCHRONIZE | MUTEX_MODIFY_STATE, FALSE, u"Global\\EmuKillMutex");
+  if (pipe == INVALID_HANDLE_VALUE || up == nullptr || idle == nullptr || mutex == nullptr) {
+    return 10;
+  }
+  if (point == KillPoint::kOwningMutex && WaitForSingleObject(mutex, 0) != WAIT_OBJECT_0) return 11;
+  SetEvent(up);
+  char buffer[16];
+  DWORD bytes = 0;
+  switch (point) {
+    case KillPoint::kInWrite:
+      emu::kernel::SetCrashPoint("pipe-push");
+      WriteFile(pipe, "doomed", 6, &bytes, nullptr);
+      break;
+    case KillPoint::kInRead:
+      ReadFile(pipe, buffer, sizeof(buffer), &bytes, nullptr);
+      break;
+    case KillPoint::kInWait:
+      WaitForSingleObject(idle, INFINITE);
+      break;
+    case KillPoint::kOwningMutex:
+      break;
+    case KillPoint::kInsideKernelLock:
+      emu::kernel::SetCrashPoint("set-event");
+      SetEvent(idle);
+      break;
+  }
+  for (;;) pause();
+}
+
+TEST_P(KilledClient, ServerProcessGoesOn) {
+  const KillPoint point = GetParam();
   HANDLE server = CreateServer();
-  ASSERT_NE(server, INVALID_HANDLE_VALUE);
-  HANDLE connected = CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuPipeClientUp"));
-  pid_t child = Fork([] {
-    HANDLE pipe =
-        CreateFileW(kPipe, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr);
-    HANDLE up = OpenEventW(EVENT_MODIFY_STATE, FALSE, WSTR("Global\\EmuPipeClientUp"));
-    if (pipe == INVALID_HANDLE_VALUE || up == nullptr) return 10;
-    SetEvent(up);
-    for (;;) pause();
-  });
-  ASSERT_EQ(WaitForSingleObject(connected, 10000), WAIT_OBJECT_0);
+  HANDLE up = CreateEventW(nullptr, TRUE, FALSE, u"Global\\EmuKillUp");
+  HANDLE idle = CreateEventW(nullptr, TRUE, FALSE, u"Global\\EmuKillIdle");
+  HANDLE mutex = CreateMutexW(nullptr, FALSE, u"Global\\EmuKillMutex");
   HANDLE event = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+  ASSERT_TRUE(server != INVALID_HANDLE_VALUE && up && idle && mutex && event);
   OVERLAPPED ov{};
   ov.hEvent = event;
-  EXPECT_FALSE(ConnectNamedPipe(server, &ov));
-  EXPECT_EQ(GetLastError(), ERROR_PIPE_CONNECTED);
-  char buffer[8];
-  EXPECT_FALSE(ReadFile(server, buffer, sizeof(buffer), nullptr, &ov));
-  ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
-  kill(child, SIGKILL);
-  EXPECT_EQ(ExitCodeOf(child), 128 + SIGKILL);
-  ASSERT_EQ(WaitForSingleObject(event, 10000), WAIT_OBJECT_0);
   DWORD bytes = 0;
-  EXPECT_FALSE(GetOverlappedResult(server, &ov, &bytes, FALSE));
+  BOOL connected = ConnectNamedPipe(server, &ov);
+  pid_t child = Fork([point] { return ClientUntilKilled(point); });
+  ASSERT_EQ(WaitForSingleObject(up, 10000), WAIT_OBJECT_0);
+  if (!connected && GetLastError() != ERROR_PIPE_CONNECTED) {
+    ASSERT_TRUE(Finish(server, &ov, connected, &bytes));
+  }
+  char buffer[16];
+  BOOL read = ReadFile(server, buffer, sizeof(buffer), &bytes, &ov);
+  DWORD readError = GetLastError();
+  if (point != KillPoint::kInWrite && point != KillPoint::kInsideKernelLock) {
+    EXPECT_FALSE(read);
+    EXPECT_EQ(readError, ERROR_IO_PENDING);  // the client is alive: nothing to read yet
+    kill(child, SIGKILL);
+  }
+  EXPECT_EQ(ExitCodeOf(child), 128 + SIGKILL);
+  SetLastError(readError);
+  EXPECT_FALSE(Finish(server, &ov, read, &bytes));
   EXPECT_EQ(GetLastError(), ERROR_BROKEN_PIPE);
-  // The instance can serve the next client after a disconnect.
+
+  EXPECT_EQ(WaitForSingleObject(mutex, 10000),
+            point == KillPoint::kOwningMutex ? WAIT_ABANDONED : WAIT_OBJECT_0);
+  EXPECT_TRUE(ReleaseMutex(mutex));
+  EXPECT_EQ(WaitForSingleObject(idle, 0), WAIT_TIMEOUT);
   EXPECT_TRUE(DisconnectNamedPipe(server));
-  EXPECT_FALSE(ConnectNamedPipe(server, &ov));
-  EXPECT_EQ(GetLastError(), ERROR_IO_PENDING);
-  HANDLE client =
-      CreateFileW(kPipe, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr);
-  EXPECT_NE(client, INVALID_HANDLE_VALUE);
-  EXPECT_TRUE(GetOverlappedResult(server, &ov, &bytes, TRUE));
-  for (HANDLE h : {client, event, connected, server}) CloseHandle(h);
+  ServeOneExchange(server, &ov);
+  for (HANDLE h : {event, mutex, idle, up, server}) CloseHandle(h);
 }
+
+INSTANTIATE_TEST_SUITE_P(AtEveryMoment, KilledClient,
+                         ::testing::Values(KillPoint::kInWrite, KillPoint::kInRead,
+                                           KillPoint::kInWait, KillPoint::kOwningMutex,
+                                           KillPoint::kInsideKernelLock));
 
 TEST(PipeProcesses, KilledServerBreaksTheClientAndRemovesThePipe) {
   HANDLE up = CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuPipeServerUp"));

@@ -59,8 +59,8 @@ void OnSignal(int signalNumber) {
   unsigned char type = signalNumber == SIGINT    ? static_cast<unsigned char>(CTRL_C_EVENT)
                        : signalNumber == SIGQUIT ? static_cast<unsigned char>(CTRL_BREAK_EVENT)
                                                  : static_cast<unsigned char>(CTRL_CLOSE_EVENT);
-  ssize_t written = write(g_writeFd, &type, 1);
-  (void)written;
+  while (write(g_writeFd, &type, 1) < 0 && errno == EINTR) {
+  }
   errno = saved;
 }
 
@@ -228,8 +228,8 @@ bool RaiseConsoleControl(DWORD controlType) {
   if (!console::EnsureStarted()) return false;
   C().raised.push_back(request);
   unsigned char marker = console::kRaisedMarker;
-  ssize_t written = write(console::g_writeFd, &marker, 1);
-  (void)written;
+  while (write(console::g_writeFd, &marker, 1) < 0 && errno == EINTR) {
+  }
   C().answered.wait(guard, [&] { return request->done; });
   return request->handled;
 }

@@ -4,6 +4,7 @@
 //   <UTC time> <TAB> <pid> <TAB> <source> <TAB> <type> <TAB> <category>
 //   <TAB> <event id> [<TAB> <insertion string>]...
 // with TAB, CR, LF and backslash inside the texts written as \t \r \n \\.
+#include <errno.h>
 #include <fcntl.h>
 #include <unistd.h>
 
@@ -100,8 +101,8 @@ void AppendToFile(const EventLogEntry& entry) {
   // processes whole.
   int fd = open(path, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
   if (fd < 0) return;
-  ssize_t written = write(fd, line.data(), line.size());
-  (void)written;
+  while (write(fd, line.data(), line.size()) < 0 && errno == EINTR) {
+  }
   close(fd);
 }
 

@@ -88,8 +88,8 @@ void QueuePush(const Ring& r, const void* data, std::uint32_t length) {
   kernel::Touch(*r.q);
   RingWrite(r, r.q->usedBytes, &length, kHeader);
   if (length != 0) RingWrite(r, r.q->usedBytes + kHeader, data, length);
-  kernel::CrashPoint("pipe-push");
   r.q->usedBytes += kHeader + length;
+  kernel::CrashPoint("pipe-push");  // half changed: the count is not yet raised
   ++r.q->messages;
 }
 
@@ -603,6 +603,10 @@ BOOL PipeEnd::Issue(PipeOp::Kind kind, void* readBuffer, const void* writeBuffer
   {
     kernel::Lock lock;
     PipeInstance* inst = Instance();
+    // An end whose process has ended is closed before anything else happens,
+    // as the system closes a process's handles when it ends.
+    if (inst != nullptr) RefreshPeers(*inst);
+    inst = Instance();
     if (inst == nullptr) {
       error = server_ ? ERROR_INVALID_HANDLE : ERROR_PIPE_NOT_CONNECTED;
     } else {
@@ -779,6 +783,8 @@ BOOL PipeEnd::SetState(const DWORD* mode, const DWORD* maxCollection, const DWOR
 BOOL PipeEnd::Peek(void* buffer, DWORD size, DWORD* bytesRead, DWORD* total, DWORD* left) {
   kernel::Lock lock;
   PipeInstance* inst = Instance();
+  if (inst != nullptr) RefreshPeers(*inst);
+  inst = Instance();
   DWORD link = inst == nullptr ? ERROR_PIPE_NOT_CONNECTED
                                : Link(*inst, server_ ? inst->connection : connection_, false);
   DWORD available = 0;

@@ -141,11 +141,18 @@ ProcessId g_self{};
 bool ReadProcess(std::int32_t pid, char* state, std::uint64_t* startTime) {
   char path[64];
   std::snprintf(path, sizeof(path), "/proc/%d/stat", pid);
-  FILE* file = std::fopen(path, "re");
-  if (file == nullptr) return false;
+  int fd;
+  do {
+    fd = open(path, O_RDONLY | O_CLOEXEC);
+  } while (fd < 0 && errno == EINTR);
+  if (fd < 0) return false;
   char buffer[1024];
-  size_t length = std::fread(buffer, 1, sizeof(buffer) - 1, file);
-  std::fclose(file);
+  ssize_t length;
+  do {
+    length = read(fd, buffer, sizeof(buffer) - 1);
+  } while (length < 0 && errno == EINTR);
+  close(fd);
+  if (length <= 0) return false;
   buffer[length] = '\0';
   const char* close = std::strrchr(buffer, ')');
   if (close == nullptr) return false;

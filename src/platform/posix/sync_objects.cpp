@@ -227,6 +227,7 @@ BOOL SetEventState(HANDLE event, std::uint32_t state) {
   }
   emu::kernel::Touch(slot->signaled);
   slot->signaled = state;
+  emu::kernel::CrashPoint("set-event");
   if (state != 0) emu::kernel::Notify(emu::KeyOf(*slot));
   return TRUE;
 }
