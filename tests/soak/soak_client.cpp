@@ -1,0 +1,70 @@
+// The client side of the soak: `stream` exchanges set-status requests on one
+// connection until it is killed (opening again when the exchange fails);
+// `probe LIMIT_MS` opens the pipe, exchanges one request and fails (exit 3)
+// when that took longer than LIMIT_MS, printing the time either way.
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+
+#include "pipe/command_message.h"
+#include "pipe/pipe_client.h"
+
+namespace {
+
+// The status value the soak keeps: the service's own "ready" value, so the
+// block stays sane while the soak runs.
+constexpr DWORD kReady = 102;
+
+bool ExchangeOnce(HANDLE pipe, CommandMessage* request, CommandMessage* reply) {
+  DWORD got = 0;
+  return ExchangeCommand(pipe, request, sizeof(*request), reply, sizeof(*reply), &got) &&
+         got == sizeof(*reply) && reply->command == kCommandSetStatus;
+}
+
+int Stream() {
+  auto request = std::make_unique<CommandMessage>();
+  auto reply = std::make_unique<CommandMessage>();
+  InitCommand(request.get(), kCommandSetStatus, kReady);
+  for (;;) {
+    HANDLE pipe = OpenCommandPipe(1000);
+    if (pipe == INVALID_HANDLE_VALUE) {
+      Sleep(10);
+      continue;
+    }
+    while (ExchangeOnce(pipe, request.get(), reply.get())) {
+    }
+    CloseHandle(pipe);
+  }
+}
+
+int Probe(long limitMs) {
+  auto request = std::make_unique<CommandMessage>();
+  auto reply = std::make_unique<CommandMessage>();
+  InitCommand(request.get(), kCommandSetStatus, kReady);
+  auto start = std::chrono::steady_clock::now();
+  HANDLE pipe = OpenCommandPipe(5000);
+  if (pipe == INVALID_HANDLE_VALUE) {
+    std::fprintf(stderr, "probe: cannot open the pipe: %lu\n", static_cast<unsigned long>(GetLastError()));
+    return 1;
+  }
+  bool ok = ExchangeOnce(pipe, request.get(), reply.get());
+  auto elapsed = std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - start);
+  CloseHandle(pipe);
+  if (!ok) {
+    std::fprintf(stderr, "probe: exchange failed: %lu\n", static_cast<unsigned long>(GetLastError()));
+    return 1;
+  }
+  std::printf("%.3f\n", elapsed.count());
+  return elapsed.count() <= static_cast<double>(limitMs) ? 0 : 3;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  if (argc == 2 && std::strcmp(argv[1], "stream") == 0) return Stream();
+  if (argc == 3 && std::strcmp(argv[1], "probe") == 0) return Probe(std::atol(argv[2]));
+  std::fprintf(stderr, "usage: soak_client stream | probe LIMIT_MS\n");
+  return 2;
+}
