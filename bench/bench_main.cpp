@@ -1,0 +1,60 @@
+// skyvane_bench [--quick] [--json FILE]: measures the figures and prints
+// them as a table, and as JSON to FILE when asked.
+#include <cstdio>
+#include <cstring>
+#include <string>
+#include <vector>
+
+#include "figures.h"
+
+namespace {
+
+void PrintTable(const std::vector<bench::Figure>& figures) {
+  std::printf("| figure | value | unit | ratio to floor |\n|---|---:|---|---|\n");
+  for (const bench::Figure& f : figures) {
+    std::string ratio = f.floorName.empty() ? "" : std::to_string(f.ratio) + " x " + f.floorName;
+    std::printf("| %s | %.1f | %s | %s |\n", f.name.c_str(), f.value, f.unit.c_str(), ratio.c_str());
+  }
+}
+
+bool WriteJson(const char* path, const std::vector<bench::Figure>& figures) {
+  FILE* out = std::fopen(path, "w");
+  if (out == nullptr) return false;
+  std::fprintf(out, "{\n  \"figures\": [\n");
+  for (std::size_t i = 0; i < figures.size(); ++i) {
+    const bench::Figure& f = figures[i];
+    std::fprintf(out, "    {\"name\": \"%s\", \"unit\": \"%s\", \"value\": %.3f", f.name.c_str(),
+                 f.unit.c_str(), f.value);
+    if (!f.floorName.empty()) {
+      std::fprintf(out, ", \"floor\": \"%s\", \"ratio\": %.3f", f.floorName.c_str(), f.ratio);
+    }
+    std::fprintf(out, "}%s\n", i + 1 < figures.size() ? "," : "");
+  }
+  std::fprintf(out, "  ]\n}\n");
+  return std::fclose(out) == 0;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  bench::Options options;
+  const char* json = nullptr;
+  for (int i = 1; i < argc; ++i) {
+    if (std::strcmp(argv[i], "--quick") == 0) {
+      options.quick = true;
+    } else if (std::strcmp(argv[i], "--json") == 0 && i + 1 < argc) {
+      json = argv[++i];
+    } else {
+      std::fprintf(stderr, "usage: skyvane_bench [--quick] [--json FILE]\n");
+      return 2;
+    }
+  }
+  std::vector<bench::Figure> figures;
+  bench::MeasureWakeLatency(options, figures);
+  PrintTable(figures);
+  if (json != nullptr && !WriteJson(json, figures)) {
+    std::fprintf(stderr, "cannot write %s\n", json);
+    return 1;
+  }
+  return 0;
+}

@@ -1,0 +1,42 @@
+// One measured figure of the benchmark, and the shared helpers to take them.
+#pragma once
+
+#include <algorithm>
+#include <chrono>
+#include <cstddef>
+#include <string>
+#include <vector>
+
+namespace bench {
+
+struct Figure {
+  std::string name;
+  std::string unit;
+  double value;
+  // The floor this figure is compared with ("" when none), and the ratio.
+  std::string floorName;
+  double ratio = 0.0;
+};
+
+struct Options {
+  bool quick = false;  // CI's short mode: few iterations, only proving it works
+};
+
+inline double NowMicros() {
+  using Clock = std::chrono::steady_clock;
+  return std::chrono::duration<double, std::micro>(Clock::now().time_since_epoch()).count();
+}
+
+// The p-th percentile (0..100) of `samples` (sorted in place).
+inline double Percentile(std::vector<double>& samples, double p) {
+  if (samples.empty()) return 0.0;
+  std::sort(samples.begin(), samples.end());
+  auto index = static_cast<std::size_t>(p / 100.0 * static_cast<double>(samples.size() - 1) + 0.5);
+  return samples[std::min(index, samples.size() - 1)];
+}
+
+// The kernel's wake-up latency: one event signalled while 64 other threads
+// wait on other events; the time until its waiter runs, p50 and p99.
+void MeasureWakeLatency(const Options& options, std::vector<Figure>& figures);
+
+}  // namespace bench
