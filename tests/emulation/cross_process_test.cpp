@@ -1,21 +1,18 @@
 // Objects shared between processes of one emulation namespace. The other
-// process is a fork() of the test program that runs a few Win32 calls and
-// leaves with _exit (no gtest in the child).
+// process is this test program started again for the case, which runs the
+// child's few Win32 calls and ends with their result.
 #include <gtest/gtest.h>
-#include <signal.h>
 
 #include <cstring>
 
-#include "fork_child.h"
+#include "child_body.h"
 #include "platform/diagnostics.h"
 #include "platform/win32.h"
 
 namespace {
 
 TEST(CrossProcess, NamedEventSetByChildReleasesWaiter) {
-  HANDLE ready = CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuXpReady"));
-  ASSERT_NE(ready, nullptr);
-  pid_t child = Fork([] {
+  RunAsChild("setter", [] {
     // The child inherits no handles: it opens the event by name.
     HANDLE event = OpenEventW(EVENT_MODIFY_STATE, FALSE, WSTR("Global\\EmuXpReady"));
     if (event == nullptr) return 10;
@@ -23,8 +20,12 @@ TEST(CrossProcess, NamedEventSetByChildReleasesWaiter) {
     if (!SetEvent(event)) return 12;
     return CloseHandle(event) ? 0 : 13;
   });
+  HANDLE ready = CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuXpReady"));
+  ASSERT_NE(ready, nullptr);
+  skytest::ChildProcess child;
+  ASSERT_TRUE(child.Start("setter"));
   EXPECT_EQ(WaitForSingleObject(ready, 10000), WAIT_OBJECT_0);
-  EXPECT_EQ(ExitCodeOf(child), 0);
+  EXPECT_EQ(child.Wait(skytest::kProcessGuardMs), 0);
   // The child's handle went with it; the parent's still works.
   EXPECT_TRUE(ResetEvent(ready));
   EXPECT_EQ(WaitForSingleObject(ready, 0), WAIT_TIMEOUT);
@@ -33,17 +34,7 @@ TEST(CrossProcess, NamedEventSetByChildReleasesWaiter) {
 
 TEST(CrossProcess, MappingContentAndLifetime) {
   constexpr DWORD kSize = 1215512;
-  HANDLE mapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0, kSize,
-                                      WSTR("Global\\EmuXpMap"));
-  ASSERT_NE(mapping, nullptr);
-  EXPECT_EQ(GetLastError(), ERROR_SUCCESS);
-  auto* view = static_cast<unsigned char*>(MapViewOfFile(mapping, FILE_MAP_ALL_ACCESS, 0, 0, 0));
-  ASSERT_NE(view, nullptr);
-  EXPECT_EQ(view[0], 0);
-  EXPECT_EQ(view[kSize - 1], 0);
-  std::memcpy(view + kSize - 5, "abcd", 4);
-
-  pid_t child = Fork([] {
+  RunAsChild("writer", [] {
     HANDLE again = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0, 4096,
                                       WSTR("Global\\EmuXpMap"));
     if (again == nullptr || GetLastError() != ERROR_ALREADY_EXISTS) return 10;
@@ -56,7 +47,16 @@ TEST(CrossProcess, MappingContentAndLifetime) {
     v[1] = 0xA5;
     return UnmapViewOfFile(v) ? 0 : 13;
   });
-  EXPECT_EQ(ExitCodeOf(child), 0);
+  HANDLE mapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0, kSize,
+                                      WSTR("Global\\EmuXpMap"));
+  ASSERT_NE(mapping, nullptr);
+  EXPECT_EQ(GetLastError(), ERROR_SUCCESS);
+  auto* view = static_cast<unsigned char*>(MapViewOfFile(mapping, FILE_MAP_ALL_ACCESS, 0, 0, 0));
+  ASSERT_NE(view, nullptr);
+  EXPECT_EQ(view[0], 0);
+  EXPECT_EQ(view[kSize - 1], 0);
+  std::memcpy(view + kSize - 5, "abcd", 4);
+  EXPECT_EQ(RunChild("writer"), 0);
   EXPECT_EQ(view[0], 0x5A);
   EXPECT_EQ(view[1], 0xA5);
 
@@ -93,11 +93,11 @@ TEST(CrossProcess, MappingContentAndLifetime) {
 }
 
 TEST(CrossProcess, ObjectsOfDeadProcessesAreFreed) {
-  pid_t child = Fork([] {
+  RunAsChild("leaker", [] {
     HANDLE e = CreateEventW(nullptr, TRUE, TRUE, WSTR("Global\\EmuXpLeaked"));
-    return e != nullptr ? 0 : 10;  // exits without closing
+    return e != nullptr ? 0 : 10;  // ends without closing
   });
-  ASSERT_EQ(ExitCodeOf(child), 0);
+  ASSERT_EQ(RunChild("leaker"), 0);
   SetLastError(0);
   HANDLE fresh = CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuXpLeaked"));
   ASSERT_NE(fresh, nullptr);

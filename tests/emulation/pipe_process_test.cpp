@@ -1,13 +1,13 @@
 // Named pipes between processes: the server's overlapped requests finish
 // when a client in another process acts (the I/O service thread of the
 // server's process completes them), and an end whose process dies counts
-// as closed.
+// as closed. The other process is this test program started again.
 #include <gtest/gtest.h>
-#include <signal.h>
+#include <unistd.h>
 
 #include <cstring>
 
-#include "fork_child.h"
+#include "child_body.h"
 #include "platform/posix/kernel.h"
 #include "platform/win32.h"
 
@@ -47,9 +47,11 @@ bool Finish(HANDLE server, OVERLAPPED* ov, BOOL started, DWORD* bytes) {
 }
 
 // Serves one client process's "ping" with "pong!" on a listening instance;
-// the next read then finds the pipe broken.
+// the next read then finds the pipe broken. The case must call
+// RunAsChild("exchange", ClientExchange) first.
 void ServeOneExchange(HANDLE server, OVERLAPPED* ov) {
-  pid_t child = Fork(ClientExchange);
+  skytest::ChildProcess child;
+  ASSERT_TRUE(child.Start("exchange"));
   DWORD bytes = 0;
   BOOL connected = ConnectNamedPipe(server, ov);
   if (!connected && GetLastError() == ERROR_PIPE_CONNECTED) {
@@ -63,13 +65,14 @@ void ServeOneExchange(HANDLE server, OVERLAPPED* ov) {
   EXPECT_EQ(std::memcmp(request, "ping", 4), 0);
   ASSERT_TRUE(Finish(server, ov, WriteFile(server, "pong!", 5, &bytes, ov), &bytes));
   EXPECT_EQ(bytes, 5u);
-  EXPECT_EQ(ExitCodeOf(child), 0);
+  EXPECT_EQ(child.Wait(skytest::kProcessGuardMs), 0);
   EXPECT_FALSE(Finish(server, ov, ReadFile(server, request, sizeof(request), &bytes, ov), &bytes));
   EXPECT_EQ(GetLastError(), ERROR_BROKEN_PIPE);
   EXPECT_TRUE(DisconnectNamedPipe(server));
 }
 
 TEST(PipeProcesses, OverlappedServerIsCompletedByAClientProcess) {
+  RunAsChild("exchange", ClientExchange);
   HANDLE server = CreateServer();
   ASSERT_NE(server, INVALID_HANDLE_VALUE);
   HANDLE event = CreateEventW(nullptr, TRUE, FALSE, nullptr);
@@ -125,6 +128,8 @@ int ClientUntilKilled(KillPoint point) {
 
 TEST_P(KilledClient, ServerProcessGoesOn) {
   const KillPoint point = GetParam();
+  RunAsChild("exchange", ClientExchange);
+  RunAsChild("doomed", [point] { return ClientUntilKilled(point); });
   HANDLE server = CreateServer();
   HANDLE up = CreateEventW(nullptr, TRUE, FALSE, u"Global\\EmuKillUp");
   HANDLE idle = CreateEventW(nullptr, TRUE, FALSE, u"Global\\EmuKillIdle");
@@ -135,7 +140,8 @@ TEST_P(KilledClient, ServerProcessGoesOn) {
   ov.hEvent = event;
   DWORD bytes = 0;
   BOOL connected = ConnectNamedPipe(server, &ov);
-  pid_t child = Fork([point] { return ClientUntilKilled(point); });
+  skytest::ChildProcess child;
+  ASSERT_TRUE(child.Start("doomed"));
   ASSERT_EQ(WaitForSingleObject(up, 10000), WAIT_OBJECT_0);
   if (!connected && GetLastError() != ERROR_PIPE_CONNECTED) {
     ASSERT_TRUE(Finish(server, &ov, connected, &bytes));
@@ -146,9 +152,9 @@ TEST_P(KilledClient, ServerProcessGoesOn) {
   if (point != KillPoint::kInWrite && point != KillPoint::kInsideKernelLock) {
     EXPECT_FALSE(read);
     EXPECT_EQ(readError, ERROR_IO_PENDING);  // the client is alive: nothing to read yet
-    kill(child, SIGKILL);
+    child.Kill();
   }
-  EXPECT_EQ(ExitCodeOf(child), 128 + SIGKILL);
+  EXPECT_EQ(child.Wait(skytest::kProcessGuardMs), 128 + 9);
   SetLastError(readError);
   EXPECT_FALSE(Finish(server, &ov, read, &bytes));
   EXPECT_EQ(GetLastError(), ERROR_BROKEN_PIPE);
@@ -168,20 +174,22 @@ INSTANTIATE_TEST_SUITE_P(AtEveryMoment, KilledClient,
                                            KillPoint::kInsideKernelLock));
 
 TEST(PipeProcesses, KilledServerBreaksTheClientAndRemovesThePipe) {
-  HANDLE up = CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuPipeServerUp"));
-  pid_t child = Fork([] {
+  RunAsChild("server", [] {
     HANDLE server = CreateServer();
     HANDLE ready = OpenEventW(EVENT_MODIFY_STATE, FALSE, WSTR("Global\\EmuPipeServerUp"));
     if (server == INVALID_HANDLE_VALUE || ready == nullptr) return 10;
     SetEvent(ready);
     for (;;) pause();
   });
+  HANDLE up = CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuPipeServerUp"));
+  skytest::ChildProcess child;
+  ASSERT_TRUE(child.Start("server"));
   ASSERT_EQ(WaitForSingleObject(up, 10000), WAIT_OBJECT_0);
   HANDLE client =
       CreateFileW(kPipe, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr);
   ASSERT_NE(client, INVALID_HANDLE_VALUE);
-  kill(child, SIGKILL);
-  EXPECT_EQ(ExitCodeOf(child), 128 + SIGKILL);
+  child.Kill();
+  EXPECT_EQ(child.Wait(skytest::kProcessGuardMs), 128 + 9);
   char buffer[8];
   DWORD bytes = 0;
   EXPECT_FALSE(ReadFile(client, buffer, sizeof(buffer), &bytes, nullptr));

@@ -107,6 +107,10 @@ ChildProcess::~ChildProcess() {
   if (Running()) Wait(0);
 }
 
+void ChildProcess::Kill() {
+  if (Running()) TerminateProcess(reinterpret_cast<HANDLE>(id_), 128 + 9);
+}
+
 #else
 
 bool ChildProcess::Start(const char* role) {
@@ -175,6 +179,10 @@ int ChildProcess::Wait(DWORD timeoutMs) {
 
 ChildProcess::~ChildProcess() {
   if (Running()) Wait(0);
+}
+
+void ChildProcess::Kill() {
+  if (Running()) kill(static_cast<pid_t>(id_), SIGKILL);
 }
 
 #endif

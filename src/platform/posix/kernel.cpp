@@ -202,14 +202,6 @@ bool Journalled(const void* address) {
   return false;
 }
 
-void LockForFork() {
-  if (t_lockDepth == 0) Acquire(GetRegion());
-}
-
-void UnlockAfterFork() {
-  if (t_lockDepth == 0) Release(GetRegion());
-}
-
 void Save(const void* address, std::size_t length) {
   Region& region = GetRegion();
   auto* base = reinterpret_cast<const std::uint8_t*>(&region);

@@ -35,8 +35,8 @@ constexpr std::uint32_t kPipeInstanceCount = 64;
 constexpr std::uint32_t kPipeQueueBytes = 64 * 1024;
 constexpr std::uint32_t kWaiterCount = 512;
 constexpr std::uint32_t kMaxWaitKeys = 72;  // 64 objects, or a process's pipe instances
-constexpr std::uint32_t kJournalEntries = 4096;
-constexpr std::uint32_t kJournalBytes = 1024 * 1024;
+constexpr std::uint32_t kJournalEntries = 32768;
+constexpr std::uint32_t kJournalBytes = 4 * 1024 * 1024;
 
 // Keys name what a waiter waits for: a slot, a pipe instance, the set of
 // pipe names (an instance that starts or stops listening), or one process
@@ -259,11 +259,8 @@ void AbandonMutexesOfProcess(const ProcessId& process);
 // Pipe ends held by `process` are closed on its behalf.
 void ClosePipeEndsOfProcess(const ProcessId& process);
 
-// Internal: the fork handlers hold the lock across fork(), so that a child
-// never starts with a region left half changed by another thread; the
-// start time of a process read from /proc (false when it is gone).
-void LockForFork();
-void UnlockAfterFork();
+// Internal: the start time of a process read from /proc (false when it is
+// gone).
 bool ReadProcessStart(std::int32_t pid, char* state, std::uint64_t* startTime);
 
 // Test hook: when `name` matches the crash point set by the test, the

@@ -183,16 +183,10 @@ void Advertise() {
   if (g_memberSocket < 0) Die("bind of the namespace member name");
 }
 
-// A child has the parent's mapping and file, and becomes a member itself.
-// The fork handlers keep the child from inheriting a held kernel lock.
-void ForkPrepare() {
-  LockForFork();
-}
-void ForkParent() {
-  UnlockAfterFork();
-}
+// A child has the parent's mapping and file, and becomes a member itself. A
+// kernel lock held by another thread of the parent at the fork is that
+// thread's: the parent releases it in the shared region as usual.
 void ForkChild() {
-  // The lock's owner is the parent's thread; the parent releases it.
   g_self = ReadSelf();
   close(g_memberSocket);
   Advertise();
@@ -223,7 +217,7 @@ Region* Attach() {
   g_region = region;
   Advertise();
   close(initSocket);
-  pthread_atfork(ForkPrepare, ForkParent, ForkChild);
+  pthread_atfork(nullptr, nullptr, ForkChild);
   return region;
 }
 
