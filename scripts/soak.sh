@@ -5,16 +5,21 @@
 # stop within 2 s on SIGINT, and nothing of the namespace may be left (no
 # file in /dev/shm, no socket name of the namespace).
 #
-#   scripts/soak.sh [--kills N] [--clients N] [SERVICE CLIENT SOAK_CLIENT]
+#   scripts/soak.sh [--kills N] [--clients N] [--limit-ms MS] [SERVICE CLIENT SOAK_CLIENT]
+#
+# --limit-ms (default 100) is the answer time allowed after a kill; builds
+# under a sanitizer run several times slower and are given more.
 #
 # Without the three programs it uses build/host-debug (building it first).
 set -uo pipefail
 kills=200
 clients=3
+limit_ms=100
 while [ $# -gt 0 ]; do
   case $1 in
     --kills) kills=$2; shift 2 ;;
     --clients) clients=$2; shift 2 ;;
+    --limit-ms) limit_ms=$2; shift 2 ;;
     *) break ;;
   esac
 done
@@ -70,7 +75,8 @@ for ((k = 1; k <= kills; k++)); do
   kill -9 "${streamers[$victim]}" 2>/dev/null
   wait "${streamers[$victim]}" 2>/dev/null
   kill -0 "$svc_pid" 2>/dev/null || fail "the service died at kill $k"
-  took=$("$soak_client" probe 100) || fail "no answer within 100 ms after kill $k (${took:-none} ms)"
+  took=$("$soak_client" probe "$limit_ms") ||
+    fail "no answer within $limit_ms ms after kill $k (${took:-none} ms)"
   awk -v a="$took" -v b="$slowest" 'BEGIN { exit !(a > b) }' && slowest=$took
   start_streamer "$victim"
 done
