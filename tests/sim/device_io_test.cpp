@@ -522,7 +522,7 @@ TEST_F(DeviceIo, VolumesLockDismountAndFailAsConfigured) {
   };
   for (const Failure& failure : {Failure{FSCTL_LOCK_VOLUME, ERROR_ACCESS_DENIED},
                                  Failure{FSCTL_DISMOUNT_VOLUME, ERROR_SHARING_VIOLATION},
-                                 Failure{IOCTL_STORAGE_CHECK_VERIFY, ERROR_IO_DEVICE}}) {
+                                 Failure{IOCTL_STORAGE_CHECK_VERIFY, 1117}}) {
     if (failure.code == IOCTL_STORAGE_CHECK_VERIFY) {
       machine->SetMediumCheckError('E', failure.error);
     } else {
