@@ -32,12 +32,14 @@ std::u16string Described(Language language, std::u16string_view english) {
     std::u16string_view english, german, japanese;
   };
   static const Row kRows[] = {
-      {u"USB Composite Device", u"USB-Verbundger\u00E4t", u"USB \u8907\u5408\u30C7\u30D0\u30A4\u30B9"},
+      {u"USB Composite Device", u"USB-Verbundger\u00E4t",
+       u"USB \u8907\u5408\u30C7\u30D0\u30A4\u30B9"},
       {u"USB Mass Storage Device", u"USB-Massenspeicherger\u00E4t",
        u"USB \u5927\u5BB9\u91CF\u8A18\u61B6\u88C5\u7F6E"},
       {u"Disk drive", u"Laufwerk", u"\u30C7\u30A3\u30B9\u30AF \u30C9\u30E9\u30A4\u30D6"},
       {u"USB Input Device", u"USB-Eingabeger\u00E4t", u"USB \u5165\u529B\u30C7\u30D0\u30A4\u30B9"},
-      {u"HID-compliant device", u"HID-konformes Ger\u00E4t", u"HID \u6E96\u62E0\u30C7\u30D0\u30A4\u30B9"},
+      {u"HID-compliant device", u"HID-konformes Ger\u00E4t",
+       u"HID \u6E96\u62E0\u30C7\u30D0\u30A4\u30B9"},
   };
   for (const Row& row : kRows) {
     if (row.english != english) continue;
@@ -152,7 +154,8 @@ void Machine::State::AddInterfaceLocked(DEVINST node, const GUID& interfaceClass
   Interface iface;
   iface.interfaceClass = interfaceClass;
   iface.node = node;
-  iface.eventName = path.empty() ? InterfaceEventName(nodes[node].instanceId, interfaceClass) : path;
+  iface.eventName =
+      path.empty() ? InterfaceEventName(nodes[node].instanceId, interfaceClass) : path;
   iface.path = path.empty() ? InterfacePath(nodes[node].instanceId, interfaceClass) : path;
   iface.drive = drive;
   iface.openable = openable;
@@ -186,8 +189,8 @@ void Machine::State::BuildDriveNodes(DriveState& d) {
     const std::string pid = s.usbPid.empty() ? s.modelCode : s.usbPid;
     const std::string usbSerial = UsbSerial(s);
     const std::string base = "USB\\VID_" + s.usbVid + "&PID_" + pid;
-    DEVINST composite =
-        NewNode(usbHub, Widen(base + "\\" + usbSerial), Described(language, u"USB Composite Device"), di);
+    DEVINST composite = NewNode(usbHub, Widen(base + "\\" + usbSerial),
+                                Described(language, u"USB Composite Device"), di);
     Node& c = nodes[composite];
     c.service = u"usbccgp";
     c.hasAddress = true;
@@ -367,7 +370,8 @@ std::vector<HeldRequest> Machine::State::RemoveSubtree(DriveState& d, DEVINST to
   auto keep = std::stable_partition(held.begin(), held.end(), [&](const HeldRequest& h) {
     return h.file->drive != d.index || goneEndpoints.count(h.file->endpoint) == 0;
   });
-  std::vector<HeldRequest> taken(std::make_move_iterator(keep), std::make_move_iterator(held.end()));
+  std::vector<HeldRequest> taken(std::make_move_iterator(keep),
+                                 std::make_move_iterator(held.end()));
   held.erase(keep, held.end());
   changed.notify_all();
   return taken;

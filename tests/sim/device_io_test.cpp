@@ -386,7 +386,8 @@ TEST_F(DeviceIo, VanishingDeviceFailsPendingAndLaterRequests) {
     std::memcpy(&cls, &record[12], sizeof cls);
     if (cls != GUID_DEVINTERFACE_DISK) continue;
     std::u16string name(reinterpret_cast<const char16_t*>(&record[28]));
-    EXPECT_NE(name.find(u"SBP2#QX&EXTERNAL_HDD"), std::u16string::npos) << "the instance ID's own case";
+    EXPECT_NE(name.find(u"SBP2#QX&EXTERNAL_HDD"), std::u16string::npos)
+        << "the instance ID's own case";
     (type == 0x8004 ? removedDisks : arrivedDisks) += 1;
   }
   EXPECT_EQ(removedDisks, 1);

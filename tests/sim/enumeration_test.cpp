@@ -144,13 +144,14 @@ TEST(LocalisedMachine, DescriptionsAreInTheSystemsLanguage) {
   const struct {
     const char* language;
     const char* composite;
-  } cases[] = {{"de", "USB-Verbundger\xC3\xA4t"},
-               {"ja", "USB \xE8\xA4\x87\xE5\x90\x88\xE3\x83\x87\xE3\x83\x90\xE3\x82\xA4\xE3\x82\xB9"}};
+  } cases[] = {
+      {"de", "USB-Verbundger\xC3\xA4t"},
+      {"ja", "USB \xE8\xA4\x87\xE5\x90\x88\xE3\x83\x87\xE3\x83\x90\xE3\x82\xA4\xE3\x82\xB9"}};
   for (const auto& c : cases) {
     std::string error;
-    auto machine = sim::LoadMachine(std::string("language ") + c.language +
-                                        "\ndrive one\n  bus usb\n  channel hid\nend\n",
-                                    &error);
+    auto machine = sim::LoadMachine(
+        std::string("language ") + c.language + "\ndrive one\n  bus usb\n  channel hid\nend\n",
+        &error);
     ASSERT_TRUE(machine) << error;
     machine->Install();
     Found disk = DiskWith("usbstor");

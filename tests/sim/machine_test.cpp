@@ -118,7 +118,8 @@ TEST_F(MachineTest, AVolumeHeldOpenVetoesTheEject) {
 }
 
 // The interface names device events carry, in delivery order.
-std::vector<std::string> EventNames(const std::vector<std::pair<DWORD, std::vector<std::uint8_t>>>& events) {
+std::vector<std::string> EventNames(
+    const std::vector<std::pair<DWORD, std::vector<std::uint8_t>>>& events) {
   std::vector<std::string> names;
   for (const auto& [type, record] : events) {
     if (record.size() <= 28 || record[4] != DBT_DEVTYP_DEVICEINTERFACE) continue;
