@@ -1,5 +1,7 @@
 #include "transport/pass_through.h"
 
+#include <cstring>
+
 #include "service/process_locks.h"
 
 namespace {
@@ -83,29 +85,49 @@ DWORD FailureCode() {
   return error != ERROR_SUCCESS ? error : ERROR_GEN_FAILURE;
 }
 
+// The outcome of a transfer the port driver completed: a SCSI status other
+// than GOOD fails, and data-in the drive returned short is zero-filled up to
+// the length asked for.
+DWORD CommandOutcome(const PassThroughRequest* request, DWORD askedLength) {
+  const SCSI_PASS_THROUGH_DIRECT& spt = request->spt;
+  if (spt.ScsiStatus != 0) {
+    const DWORD code = kScsiStatusErrorBase | spt.ScsiStatus;
+    SetLastError(code);
+    return code;
+  }
+  if (spt.DataIn == SCSI_IOCTL_DATA_IN && spt.DataTransferLength < askedLength &&
+      spt.DataBuffer != nullptr) {
+    std::memset(static_cast<BYTE*>(spt.DataBuffer) + spt.DataTransferLength, 0,
+                askedLength - spt.DataTransferLength);
+  }
+  return ERROR_SUCCESS;
+}
+
 // Sends a filled request through IoControlWait (READ CAPACITY and INQUIRY).
 DWORD SendThroughIoControlWait(HANDLE device, PassThroughRequest* request, HANDLE abortEvent) {
+  const DWORD asked = request->spt.DataTransferLength;
   DWORD bytes = 0;
   if (!IoControlWait(device, IOCTL_SCSI_PASS_THROUGH_DIRECT, request, sizeof(PassThroughRequest),
                      request, sizeof(PassThroughRequest), &bytes, abortEvent)) {
     return FailureCode();
   }
-  return ERROR_SUCCESS;
+  return CommandOutcome(request, asked);
 }
 
 // Sends a filled diagnostic request on the caller's overlapped record.
 DWORD SendDiagnostic(HANDLE device, PassThroughRequest* request, OVERLAPPED* overlapped,
                      HANDLE abortEvent) {
+  const DWORD asked = request->spt.DataTransferLength;
   DWORD bytes = 0;
   if (DeviceIoControl(device, IOCTL_SCSI_PASS_THROUGH_DIRECT, request, sizeof(PassThroughRequest),
                       request, sizeof(PassThroughRequest), &bytes, overlapped)) {
-    return ERROR_SUCCESS;
+    return CommandOutcome(request, asked);
   }
   const DWORD error = GetLastError();
   if (error != ERROR_IO_PENDING) return error != ERROR_SUCCESS ? error : ERROR_GEN_FAILURE;
   if (WaitForRequest(device, overlapped, abortEvent, &bytes) == WaitOutcome::Completed) {
     SetLastError(ERROR_SUCCESS);
-    return ERROR_SUCCESS;
+    return CommandOutcome(request, asked);
   }
   return ERROR_IO_PENDING;
 }

@@ -31,6 +31,10 @@ static_assert(offsetof(PassThroughRequest, totalLength) == 56);
 static_assert(offsetof(PassThroughRequest, sense) == 60);
 
 constexpr DWORD kCancelGraceMs = 3000;
+// A command the drive answered with a SCSI status other than GOOD fails with
+// this application-defined code plus the status (0x20000002 for CHECK
+// CONDITION), as result and as the thread's last error.
+constexpr DWORD kScsiStatusErrorBase = 0x20000000;
 constexpr BYTE kInquiryLength = 74;
 
 // Issues the control with an own overlapped record and waits for it or for
@@ -39,7 +43,8 @@ constexpr BYTE kInquiryLength = 74;
 bool IoControlWait(HANDLE device, DWORD controlCode, void* input, DWORD inputLength, void* output,
                    DWORD outputLength, DWORD* bytesReturned, HANDLE abortEvent);
 
-// The SCSI commands. Each returns a Win32 error code, 0 on success.
+// The SCSI commands. Each returns a Win32 error code, 0 on success. Data the
+// drive returned short of the length asked for is zero-filled to it.
 // READ CAPACITY(10): both outputs in host order, written only on success.
 DWORD ScsiReadCapacity(HANDLE device, DWORD* lastLba, DWORD* blockLength, HANDLE abortEvent);
 // Standard INQUIRY into buffer[kInquiryLength].

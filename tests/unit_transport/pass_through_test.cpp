@@ -6,6 +6,7 @@
 
 #include <gtest/gtest.h>
 
+#include <cstring>
 #include <thread>
 #include <vector>
 
@@ -120,6 +121,31 @@ TEST_F(PassThroughTest, DeviceErrorsBecomeTheResult) {
   BYTE status[8] = {};
   EXPECT_EQ(ReceiveDiagnosticPage(disk_.Get(), 0x82, status, sizeof(status), &overlapped, nullptr),
             kIoError);
+}
+
+TEST_F(PassThroughTest, RejectedCommandsFailAndShortRepliesAreZeroFilled) {
+  // CHECK CONDITION (status 2) for pages the drive does not have.
+  constexpr DWORD kCheckCondition = kScsiStatusErrorBase | 0x02;
+  BYTE page[20];
+  std::memset(page, 0xAA, sizeof(page));
+  EXPECT_EQ(ScsiInquiryPage(disk_.Get(), 0x83, page, sizeof(page), abort_.Get()), kCheckCondition);
+  EXPECT_EQ(GetLastError(), kCheckCondition);
+  OVERLAPPED overlapped{};
+  overlapped.hEvent = ownEvent_.Get();
+  EXPECT_EQ(ReceiveDiagnosticPage(disk_.Get(), 0x85, page, 8, &overlapped, abort_.Get()),
+            kCheckCondition);
+  const BYTE unknown[5] = {0x84, 0x00, 0x00, 0x01, 0x00};
+  overlapped = OVERLAPPED{};
+  overlapped.hEvent = ownEvent_.Get();
+  EXPECT_EQ(SendDiagnosticPage(disk_.Get(), unknown, sizeof(unknown), &overlapped, nullptr),
+            kCheckCondition);
+
+  // Page 0x00 of six pages is 10 bytes: the rest of the 20 asked for is zero.
+  std::memset(page, 0xAA, sizeof(page));
+  ASSERT_EQ(ScsiInquiryPage(disk_.Get(), 0x00, page, sizeof(page), abort_.Get()), 0u);
+  EXPECT_EQ(page[3], 6);
+  EXPECT_EQ(page[9], 0xC1);
+  for (std::size_t i = 10; i < sizeof(page); ++i) EXPECT_EQ(page[i], 0) << i;
 }
 
 TEST_F(PassThroughTest, SynchronousHandleWithoutEventCompletesInline) {
