@@ -460,6 +460,13 @@ void SimFile::Cancel(const emu::IoRequestPtr& request) {
         return;
       }
     }
+    // A request whose cancellation is already under way is not hurried by
+    // a second CancelIo.
+    auto cancelling = [&](const TimedCompletion& c) { return c.request == request; };
+    if (std::any_of(state_->heldCancels.begin(), state_->heldCancels.end(), cancelling) ||
+        std::any_of(state_->timed.begin(), state_->timed.end(), cancelling)) {
+      return;
+    }
   }
   emu::CompleteIo(request, ERROR_OPERATION_ABORTED, 0);
 }

@@ -4,11 +4,11 @@
 //
 // Abort: when the abort event is signalled while a request is pending, the
 // handle's I/O is cancelled and 3000 ms are granted for the cancellation.
-// A device slow to cancel may still write into the request block, the
-// OVERLAPPED record and the data buffer after that grace, so the operation
-// then goes on waiting for the completion, without limit, before it frees
-// anything and returns. The port driver ends every pass-through at the
-// latest with its own command time-out, so the wait is bounded in practice.
+// Every request runs on a heap block of its own (OVERLAPPED record, event,
+// request and data buffers; io_block.h), so a device that has not finished
+// cancelling after the grace writes only into that block, which is set
+// aside, never into the caller's buffers: the operation returns after the
+// grace whatever the device does.
 #pragma once
 
 #include <cstddef>
@@ -52,8 +52,9 @@ DWORD ScsiInquiry(HANDLE device, BYTE* buffer, HANDLE abortEvent);
 // INQUIRY of a vital-product-data page into buffer[length].
 DWORD ScsiInquiryPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE length, HANDLE abortEvent);
 
-// The diagnostic pages, on the caller's overlapped record (its event may be
-// null for a handle opened without overlapped I/O). A transfer that was
+// The diagnostic pages. The caller's overlapped record must be given (its
+// event may be null for a handle opened without overlapped I/O); the
+// transfer runs on a record of its own. A transfer that was
 // started but did not complete successfully reports ERROR_IO_PENDING (997);
 // the thread's last error then tells the cause (995 after an abort).
 DWORD ReceiveDiagnosticPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE length,
@@ -61,10 +62,3 @@ DWORD ReceiveDiagnosticPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE len
 // buffer holds the whole page, header included.
 DWORD SendDiagnosticPage(HANDLE device, const BYTE* buffer, BYTE length, OVERLAPPED* overlapped,
                          HANDLE abortEvent);
-
-// Cancels the calling thread's I/O on the handle and returns only once the
-// request on `overlapped` has really completed (a grace wait on its event
-// first, then without limit), because the device may write into the
-// request's buffers until it completes. Every transport that abandons a
-// pending request uses it.
-void SettleCancelledRequest(HANDLE device, OVERLAPPED* overlapped);

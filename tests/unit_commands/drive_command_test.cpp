@@ -6,6 +6,7 @@
 
 #include "commands_fixture.h"
 #include "support/test_support.h"
+#include "transport/io_block.h"
 
 namespace cmdtest {
 namespace {
@@ -158,6 +159,15 @@ TEST_F(DriveCommandTest, CommandThatDoesNotCompleteIsCancelledAndFails) {
   EXPECT_EQ(SendDriveCommand(Gauge(), CTL_SET_GAUGE, 0x8100, nullptr), 0u);
   EXPECT_EQ(machine_.PendingCount("gauge", sim::Endpoint::Hid), 0u);
   EXPECT_EQ(HidReports("gauge").size(), 1u) << "the report reached the device";
+
+  // A driver that never finishes the cancellation holds the sender only for
+  // the grace; the request is set aside until the driver completes it.
+  const std::size_t aside = SetAsideIoBlockCount();
+  machine_.SetCancelDelay("firewire", sim::Endpoint::Driver, INFINITE);
+  EXPECT_EQ(SendDriveCommand(FireWire(), CTL_SET_STATE, 1, nullptr), 0u);
+  EXPECT_EQ(SetAsideIoBlockCount(), aside + 1);
+  machine_.FinishHeldCancels();
+  EXPECT_EQ(SetAsideIoBlockCount(), aside);
 }
 
 TEST_F(DriveCommandTest, DispatcherRejectsCodesItDoesNotAccept) {
