@@ -1,19 +1,35 @@
 #include "transport/io_block.h"
 
-#include <mutex>
 #include <vector>
 
 #include "transport/pass_through.h"
 
 namespace {
 
+// Holds a critical section for one scope.
+class Guard {
+ public:
+  explicit Guard(CRITICAL_SECTION* section) : section_(section) { EnterCriticalSection(section_); }
+  ~Guard() { LeaveCriticalSection(section_); }
+  Guard(const Guard&) = delete;
+  Guard& operator=(const Guard&) = delete;
+
+ private:
+  CRITICAL_SECTION* section_;
+};
+
 struct SetAside {
-  std::mutex lock;
+  CRITICAL_SECTION lock;
   std::vector<IoBlock*> blocks;
 };
 
 SetAside& Aside() {
-  static SetAside* aside = new SetAside();  // lives to the end of the process
+  // Lives to the end of the process: blocks set aside may outlive any owner.
+  static SetAside* aside = [] {
+    auto* made = new SetAside();
+    InitializeCriticalSection(&made->lock);
+    return made;
+  }();
   return *aside;
 }
 
@@ -31,7 +47,7 @@ void Reap() {
   std::vector<IoBlock*> done;
   {
     SetAside& aside = Aside();
-    std::lock_guard<std::mutex> guard(aside.lock);
+    Guard guard(&aside.lock);
     for (auto it = aside.blocks.begin(); it != aside.blocks.end();) {
       if (Completed(*it)) {
         done.push_back(*it);
@@ -78,7 +94,7 @@ void AbandonIoBlock(HANDLE device, IoBlock* block) {
     Release(block);
   } else {
     SetAside& aside = Aside();
-    std::lock_guard<std::mutex> guard(aside.lock);
+    Guard guard(&aside.lock);
     aside.blocks.push_back(block);
   }
   SetLastError(error);
@@ -87,7 +103,7 @@ void AbandonIoBlock(HANDLE device, IoBlock* block) {
 std::size_t SetAsideIoBlockCount() {
   Reap();
   SetAside& aside = Aside();
-  std::lock_guard<std::mutex> guard(aside.lock);
+  Guard guard(&aside.lock);
   return aside.blocks.size();
 }
 

@@ -1,12 +1,23 @@
 #include "transport/refresh_on_change.h"
 
 #include <cstring>
-#include <mutex>
 
 #include "monitor/monitor_state.h"
 #include "platform/wide.h"
 
 namespace {
+
+// Holds a critical section for one scope.
+class Guard {
+ public:
+  explicit Guard(CRITICAL_SECTION* section) : section_(section) { EnterCriticalSection(section_); }
+  ~Guard() { LeaveCriticalSection(section_); }
+  Guard(const Guard&) = delete;
+  Guard& operator=(const Guard&) = delete;
+
+ private:
+  CRITICAL_SECTION* section_;
+};
 
 constexpr std::size_t kKeyUnits = 256;
 constexpr std::size_t kRemembered = 64;
@@ -17,15 +28,19 @@ struct Entry {
 };
 
 struct Table {
-  std::mutex lock;
+  CRITICAL_SECTION lock;
   const StateBlock* block = nullptr;
   Entry entries[kRemembered] = {};
   std::size_t nextEvicted = 0;
 };
 
 Table& Conditions() {
-  static Table table;
-  return table;
+  static Table* table = [] {
+    auto* made = new Table();
+    InitializeCriticalSection(&made->lock);
+    return made;
+  }();
+  return *table;
 }
 
 // The text that tells this drive apart from the others.
@@ -69,7 +84,7 @@ void NoteRefreshConditions(const DriveRecord* drive, DWORD conditions, bool hold
   bool ask = false;
   {
     Table& table = Conditions();
-    std::lock_guard<std::mutex> guard(table.lock);
+    Guard guard(&table.lock);
     if (table.block != monitorState.stateBlock) {
       Reset(table);
       table.block = monitorState.stateBlock;
@@ -85,6 +100,6 @@ void NoteRefreshConditions(const DriveRecord* drive, DWORD conditions, bool hold
 
 void ForgetRefreshConditions() {
   Table& table = Conditions();
-  std::lock_guard<std::mutex> guard(table.lock);
+  Guard guard(&table.lock);
   Reset(table);
 }
