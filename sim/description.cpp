@@ -369,6 +369,16 @@ std::unique_ptr<Machine> LoadMachine(std::string_view text, std::string* error) 
       }
       DWORD platform = major == 4 && minor > 0 ? VER_PLATFORM_WIN32_WINDOWS : VER_PLATFORM_WIN32_NT;
       machine->SetOsVersion(static_cast<DWORD>(major), static_cast<DWORD>(minor), build, platform);
+    } else if (key == "language") {
+      if (value == "en") {
+        machine->SetLanguage(Language::English);
+      } else if (value == "de") {
+        machine->SetLanguage(Language::German);
+      } else if (value == "ja") {
+        machine->SetLanguage(Language::Japanese);
+      } else {
+        return fail("language is en, de or ja");
+      }
     } else if (key == "volume") {
       VolumeSpec v;
       if (!ParseVolume(value, &v)) return fail("volume needs: letter type size free [options]");

@@ -120,14 +120,18 @@ emu::IoStart DeviceNumber(DWORD type, DWORD number, DWORD partition, void* outpu
 emu::IoStart VolumeControl(const Target& t, DWORD code, void* output, DWORD outputLength) {
   VolumeState* v = t.state->FindVolume(t.volume);
   if (v == nullptr) return Done(ERROR_DEVICE_NOT_CONNECTED);
+  // The file system mounts a dismounted volume again at its first access
+  // once nobody holds it locked.
+  if (v->lockOwner == nullptr) v->mounted = true;
   switch (code) {
     case IOCTL_STORAGE_GET_DEVICE_NUMBER:
       return DeviceNumber(v->spec.driveType == DRIVE_CDROM ? kFileDeviceCdRom : kFileDeviceDisk,
                           v->spec.diskNumber, v->spec.partition, output, outputLength);
     case IOCTL_STORAGE_CHECK_VERIFY:
     case kCheckVerify2:
-      return Done(v->mediumFails ? ERROR_NOT_READY : ERROR_SUCCESS);
+      return Done(v->mediumError);
     case FSCTL_LOCK_VOLUME:
+      if (v->lockError != 0) return Done(v->lockError);
       if (v->heldOpen || (v->lockOwner != nullptr && v->lockOwner != t.file)) {
         return Done(ERROR_ACCESS_DENIED);
       }
@@ -138,7 +142,9 @@ emu::IoStart VolumeControl(const Target& t, DWORD code, void* output, DWORD outp
       v->lockOwner = nullptr;
       return Done(ERROR_SUCCESS);
     case FSCTL_DISMOUNT_VOLUME:
+      if (v->dismountError != 0) return Done(v->dismountError);
       ++v->dismounts;
+      v->mounted = false;
       return Done(ERROR_SUCCESS);
     default:
       return Done(ERROR_INVALID_FUNCTION);
@@ -453,6 +459,13 @@ void SimFile::Cancel(const emu::IoRequestPtr& request) {
         }
         return;
       }
+    }
+    // A request whose cancellation is already under way is not hurried by
+    // a second CancelIo.
+    auto cancelling = [&](const TimedCompletion& c) { return c.request == request; };
+    if (std::any_of(state_->heldCancels.begin(), state_->heldCancels.end(), cancelling) ||
+        std::any_of(state_->timed.begin(), state_->timed.end(), cancelling)) {
+      return;
     }
   }
   emu::CompleteIo(request, ERROR_OPERATION_ABORTED, 0);

@@ -108,6 +108,7 @@ CONFIGRET Machine::Property(DEVINST node, DWORD spdrp, DWORD* regType, std::vect
 CONFIGRET Machine::Eject(DEVINST node, bool queryAndRemove, PNP_VETO_TYPE* vetoType,
                          std::u16string* vetoName) {
   std::string driveName;
+  std::vector<HeldRequest> taken;
   {
     std::lock_guard<std::mutex> lock(state_->mutex);
     State& s = *state_;
@@ -142,9 +143,17 @@ CONFIGRET Machine::Eject(DEVINST node, bool queryAndRemove, PNP_VETO_TYPE* vetoT
     }
     s.ejects.push_back(request);
     if (request.vetoed) return CR_REMOVE_VETOED;
-    driveName = d.spec.name;
+    // Only the subtree of the node goes: ejecting the storage function
+    // leaves the drive's HID function in place. The topmost node takes all.
+    const Node* above = s.FindNode(n->parent);
+    if (above == nullptr || above->drive != d.index) {
+      driveName = d.spec.name;
+    } else {
+      taken = s.RemoveSubtree(d, node);
+    }
   }
-  Detach(driveName, ERROR_DEVICE_NOT_CONNECTED);
+  for (auto& h : taken) emu::CompleteIo(h.request, ERROR_DEVICE_NOT_CONNECTED, 0);
+  if (!driveName.empty()) Detach(driveName, ERROR_DEVICE_NOT_CONNECTED);
   return CR_SUCCESS;
 }
 
@@ -227,6 +236,7 @@ std::unique_ptr<emu::DeviceFile> Machine::Open(const WCHAR* path, DWORD access, 
       *error = ERROR_ACCESS_DENIED;
       return nullptr;
     }
+    v->mounted = true;
     return std::make_unique<SimFile>(state_, v->drive, Endpoint::Volume, letter, 0, access);
   }
   // Interface paths: "\\?\" and "\\.\" name the same device; case is ignored.

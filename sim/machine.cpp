@@ -83,6 +83,11 @@ Machine::~Machine() {
   for (auto& t : late) emu::CompleteIo(t.request, t.error, 0);
 }
 
+void Machine::SetLanguage(Language language) {
+  std::lock_guard<std::mutex> lock(state_->mutex);
+  state_->language = language;
+}
+
 void Machine::SetOsVersion(DWORD major, DWORD minor, DWORD build, DWORD platformId) {
   std::lock_guard<std::mutex> lock(state_->mutex);
   state_->os.major = major;
@@ -175,15 +180,25 @@ void Machine::Uninstall() {
 // ---- Plug and Play -------------------------------------------------------------
 
 void Machine::Attach(const std::string& drive) {
-  std::lock_guard<std::mutex> lock(state_->mutex);
-  DriveState* d = state_->FindDrive(drive);
-  if (d == nullptr || d->attached) return;
-  d->attached = true;
-  d->goneError = 0;
-  d->driverEvents.clear();
-  d->enclosureBits = 0;
-  state_->BuildDriveNodes(*d);
-  state_->QueueEvents(state_->DriveEvents(d->index, kArrival));
+  std::vector<HeldRequest> taken;
+  {
+    std::lock_guard<std::mutex> lock(state_->mutex);
+    DriveState* d = state_->FindDrive(drive);
+    if (d == nullptr || state_->DiskPresent(*d)) return;
+    if (d->attached) {
+      // What an eject of one function left of the drive goes before the
+      // drive comes back whole.
+      taken = state_->TakeDriveRequests(d->index, ERROR_DEVICE_NOT_CONNECTED);
+      state_->RemoveDriveNodes(*d);
+    }
+    d->attached = true;
+    d->goneError = 0;
+    d->driverEvents.clear();
+    d->enclosureBits = 0;
+    state_->BuildDriveNodes(*d);
+    state_->QueueEvents(state_->DriveEvents(d->index, kArrival));
+  }
+  for (auto& h : taken) emu::CompleteIo(h.request, ERROR_DEVICE_NOT_CONNECTED, 0);
 }
 
 void Machine::Detach(const std::string& drive, DWORD error) {
@@ -210,7 +225,7 @@ bool Machine::WaitForDeviceEvents(DWORD timeoutMs) const {
 bool Machine::Attached(const std::string& drive) const {
   std::lock_guard<std::mutex> lock(state_->mutex);
   const DriveState* d = state_->FindDrive(drive);
-  return d != nullptr && d->attached;
+  return d != nullptr && state_->DiskPresent(*d);
 }
 
 void Machine::SetEjectVeto(const std::string& drive, PNP_VETO_TYPE type,
@@ -317,8 +332,26 @@ void Machine::SetVolumeHeldOpen(char letter, bool held) {
 }
 
 void Machine::SetMediumCheckFails(char letter, bool fails) {
+  SetMediumCheckError(letter, fails ? ERROR_NOT_READY : 0);
+}
+
+void Machine::SetMediumCheckError(char letter, DWORD error) {
   std::lock_guard<std::mutex> lock(state_->mutex);
-  if (VolumeState* v = AnyVolume(*state_, letter)) v->mediumFails = fails;
+  if (VolumeState* v = AnyVolume(*state_, letter)) v->mediumError = error;
+}
+
+void Machine::SetVolumeControlError(char letter, DWORD code, DWORD error) {
+  std::lock_guard<std::mutex> lock(state_->mutex);
+  VolumeState* v = AnyVolume(*state_, letter);
+  if (v == nullptr) return;
+  if (code == FSCTL_LOCK_VOLUME) v->lockError = error;
+  if (code == FSCTL_DISMOUNT_VOLUME) v->dismountError = error;
+}
+
+bool Machine::VolumeMounted(char letter) const {
+  std::lock_guard<std::mutex> lock(state_->mutex);
+  const VolumeState* v = AnyVolume(*state_, letter);
+  return v != nullptr && v->mounted;
 }
 
 void Machine::SetFreeBytes(char letter, std::uint64_t freeBytes) {

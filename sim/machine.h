@@ -29,6 +29,9 @@ enum class ChannelKind {
   Driver,     // interface of the button filter driver (event-wait controls)
   Enclosure,  // IEEE 1394 enclosure-services device (diagnostic page 0x80)
 };
+// The display language of the system: device descriptions are written in it.
+enum class Language { English, German, Japanese };
+
 // The parts of a drive that can be opened, for fault injection and records.
 enum class Endpoint { Disk, Hid, Driver, Enclosure, Volume };
 
@@ -127,6 +130,8 @@ class Machine : public emu::DeviceModel {
   // ---- Building ----
   void SetOsVersion(DWORD major, DWORD minor, DWORD build = 2195,
                     DWORD platformId = VER_PLATFORM_WIN32_NT);
+  // Applies to device nodes built after the call (drives attached later).
+  void SetLanguage(Language language);
   // Adds a drive; it is present from the start (no arrival events) unless
   // `attached` is false.
   void AddDrive(const DriveSpec& spec, bool attached = true);
@@ -167,9 +172,10 @@ class Machine : public emu::DeviceModel {
     bool vetoed = false;
   };
   std::vector<EjectRequest> Ejects() const;
-  // Device events (arrival, remove-complete) go here, in order, on a thread
-  // of the machine; by default to the emulated service manager's
-  // DeliverDeviceEvent.
+  // Device events (arrival, remove-complete) go here, in order, one at a
+  // time on a thread of the machine: an event is handed over only once the
+  // sink returned from the one before. By default to the emulated service
+  // manager's DeliverDeviceEvent.
   void SetDeviceEventSink(std::function<void(DWORD eventType, const void* record)> sink);
   // Waits (real time) until every event queued so far was delivered.
   bool WaitForDeviceEvents(DWORD timeoutMs = 10000) const;
@@ -182,7 +188,14 @@ class Machine : public emu::DeviceModel {
 
   // ---- Volumes ----
   void SetVolumeHeldOpen(char letter, bool held);     // another program: lock fails
-  void SetMediumCheckFails(char letter, bool fails);  // IOCTL_STORAGE_CHECK_VERIFY fails
+  void SetMediumCheckFails(char letter, bool fails);  // IOCTL_STORAGE_CHECK_VERIFY: not ready
+  // IOCTL_STORAGE_CHECK_VERIFY fails with `error` (0: succeeds again).
+  void SetMediumCheckError(char letter, DWORD error);
+  // FSCTL_LOCK_VOLUME or FSCTL_DISMOUNT_VOLUME of the volume fails with
+  // `error` (0: succeeds again).
+  void SetVolumeControlError(char letter, DWORD code, DWORD error);
+  // A dismounted volume mounts again on its first access after it is unlocked.
+  bool VolumeMounted(char letter) const;
   void SetFreeBytes(char letter, std::uint64_t freeBytes);
   int DismountCount(char letter) const;
   bool VolumeLocked(char letter) const;

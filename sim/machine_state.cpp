@@ -26,6 +26,29 @@ const GUID kSetupClassVolume = {
 
 namespace {
 
+// A device description in the machine's language.
+std::u16string Described(Language language, std::u16string_view english) {
+  struct Row {
+    std::u16string_view english, german, japanese;
+  };
+  static const Row kRows[] = {
+      {u"USB Composite Device", u"USB-Verbundger\u00E4t",
+       u"USB \u8907\u5408\u30C7\u30D0\u30A4\u30B9"},
+      {u"USB Mass Storage Device", u"USB-Massenspeicherger\u00E4t",
+       u"USB \u5927\u5BB9\u91CF\u8A18\u61B6\u88C5\u7F6E"},
+      {u"Disk drive", u"Laufwerk", u"\u30C7\u30A3\u30B9\u30AF \u30C9\u30E9\u30A4\u30D6"},
+      {u"USB Input Device", u"USB-Eingabeger\u00E4t", u"USB \u5165\u529B\u30C7\u30D0\u30A4\u30B9"},
+      {u"HID-compliant device", u"HID-konformes Ger\u00E4t",
+       u"HID \u6E96\u62E0\u30C7\u30D0\u30A4\u30B9"},
+  };
+  for (const Row& row : kRows) {
+    if (row.english != english) continue;
+    if (language == Language::German) return std::u16string(row.german);
+    if (language == Language::Japanese) return std::u16string(row.japanese);
+  }
+  return std::u16string(english);
+}
+
 const GUID& VendorClass(int which) {
   return which == 2 ? kVendorClassB : which == 3 ? kVendorClassC : kVendorClassA;
 }
@@ -48,13 +71,13 @@ std::string HashPart(int index, int salt) {
 
 // A DEV_BROADCAST_DEVICEINTERFACE_W record for one interface.
 std::vector<std::uint8_t> InterfaceRecord(const Interface& iface) {
-  std::vector<std::uint8_t> record(28 + (iface.path.size() + 1) * 2, 0);
+  std::vector<std::uint8_t> record(28 + (iface.eventName.size() + 1) * 2, 0);
   const DWORD size = static_cast<DWORD>(record.size());
   const DWORD type = 5;  // DBT_DEVTYP_DEVICEINTERFACE
   std::memcpy(&record[0], &size, 4);
   std::memcpy(&record[4], &type, 4);
   std::memcpy(&record[12], &iface.interfaceClass, 16);
-  std::memcpy(&record[28], iface.path.c_str(), (iface.path.size() + 1) * 2);
+  std::memcpy(&record[28], iface.eventName.c_str(), (iface.eventName.size() + 1) * 2);
   return record;
 }
 
@@ -93,7 +116,16 @@ Node* Machine::State::FindNode(DEVINST id) {
 }
 
 bool Machine::State::VolumePresent(const VolumeState& volume) const {
-  return volume.drive < 0 || drives[static_cast<std::size_t>(volume.drive)]->attached;
+  return volume.drive < 0 ||
+         (drives[static_cast<std::size_t>(volume.drive)]->attached && volume.node != 0);
+}
+
+bool Machine::State::DiskPresent(const DriveState& drive) const {
+  if (!drive.attached) return false;
+  for (const Interface& i : interfaces) {
+    if (i.drive == drive.index && i.endpoint == Endpoint::Disk && i.openable) return true;
+  }
+  return false;
 }
 
 VolumeState* Machine::State::FindVolume(char letter) {
@@ -122,6 +154,8 @@ void Machine::State::AddInterfaceLocked(DEVINST node, const GUID& interfaceClass
   Interface iface;
   iface.interfaceClass = interfaceClass;
   iface.node = node;
+  iface.eventName =
+      path.empty() ? InterfaceEventName(nodes[node].instanceId, interfaceClass) : path;
   iface.path = path.empty() ? InterfacePath(nodes[node].instanceId, interfaceClass) : path;
   iface.drive = drive;
   iface.openable = openable;
@@ -155,8 +189,8 @@ void Machine::State::BuildDriveNodes(DriveState& d) {
     const std::string pid = s.usbPid.empty() ? s.modelCode : s.usbPid;
     const std::string usbSerial = UsbSerial(s);
     const std::string base = "USB\\VID_" + s.usbVid + "&PID_" + pid;
-    DEVINST composite =
-        NewNode(usbHub, Widen(base + "\\" + usbSerial), u"USB Composite Device", di);
+    DEVINST composite = NewNode(usbHub, Widen(base + "\\" + usbSerial),
+                                Described(language, u"USB Composite Device"), di);
     Node& c = nodes[composite];
     c.service = u"usbccgp";
     c.hasAddress = true;
@@ -167,7 +201,7 @@ void Machine::State::BuildDriveNodes(DriveState& d) {
     AddInterfaceLocked(composite, GUID_DEVINTERFACE_USB_DEVICE, u"", di, false, Endpoint::Disk);
     DEVINST storageParent = NewNode(
         composite, idOr(s.parentInstanceId, base + "&MI_00\\6&" + HashPart(di, 1) + "&0&0000"),
-        u"USB Mass Storage Device", di);
+        Described(language, u"USB Mass Storage Device"), di);
     Node& m = nodes[storageParent];
     m.service = Widen(s.parentService.empty() ? "USBSTOR" : s.parentService);
     m.hasAddress = true;
@@ -181,7 +215,7 @@ void Machine::State::BuildDriveNodes(DriveState& d) {
                 idOr(s.diskInstanceId, "USBSTOR\\DISK&VEN_" + vendorUpper + "&PROD_" +
                                            UpperUnderscored(TrimAscii(s.product)) + "&REV_" +
                                            UpperUnderscored(s.revision) + "\\" + usbSerial + "&0"),
-                u"Disk drive", di);
+                Described(language, u"Disk drive"), di);
     Node& n = nodes[disk];
     n.friendlyName = Widen(s.friendlyName.empty()
                                ? TrimAscii(s.vendor) + " " + TrimAscii(s.product) + " USB Device"
@@ -196,13 +230,13 @@ void Machine::State::BuildDriveNodes(DriveState& d) {
     if (s.channel == ChannelKind::Hid) {
       DEVINST function =
           NewNode(composite, Widen(base + "&MI_01\\6&" + HashPart(di, 2) + "&0&0001"),
-                  u"USB Input Device", di);
+                  Described(language, u"USB Input Device"), di);
       nodes[function].service = u"HidUsb";
       nodes[function].setupClass = kSetupClassHid;
       DEVINST hid = NewNode(function,
                             idOr(s.hidInstanceId, "HID\\VID_" + s.usbVid + "&PID_" + pid +
                                                       "&MI_01\\7&" + HashPart(di, 3) + "&0&0000"),
-                            u"HID-compliant device", di);
+                            Described(language, u"HID-compliant device"), di);
       nodes[hid].setupClass = kSetupClassHid;
       AddInterfaceLocked(hid, emu::kHidInterfaceClass, u"", di, true, Endpoint::Hid);
     }
@@ -223,7 +257,7 @@ void Machine::State::BuildDriveNodes(DriveState& d) {
     controlNode = unit;
     DEVINST disk = NewNode(
         unit, idOr(s.diskInstanceId, "SBP2\\" + vendorUpper + "&" + unitModel + "&LUN0\\" + unitId),
-        u"Disk drive", di);
+        Described(language, u"Disk drive"), di);
     Node& n = nodes[disk];
     std::string vendorField = s.vendor;
     vendorField.resize(8, ' ');
@@ -280,6 +314,67 @@ void Machine::State::RemoveDriveNodes(DriveState& d) {
       v.lockOwner = nullptr;
     }
   }
+}
+
+std::vector<HeldRequest> Machine::State::RemoveSubtree(DriveState& d, DEVINST top) {
+  std::set<DEVINST> gone;
+  for (DEVINST id : d.nodes) {
+    for (DEVINST n = id; n != 0;) {
+      if (n == top) {
+        gone.insert(id);
+        break;
+      }
+      const Node* node = FindNode(n);
+      n = node != nullptr ? node->parent : 0;
+    }
+  }
+  std::set<Endpoint> goneEndpoints;
+  std::vector<QueuedEvent> queued;
+  for (const Interface& i : interfaces) {
+    if (i.drive != d.index || gone.count(i.node) == 0) continue;
+    if (i.openable) goneEndpoints.insert(i.endpoint);
+    queued.push_back({kRemoveComplete, InterfaceRecord(i)});
+  }
+  // The volumes of a disk that goes go with it.
+  DWORD mask = 0;
+  if (goneEndpoints.count(Endpoint::Disk) != 0) {
+    goneEndpoints.insert(Endpoint::Volume);
+    for (VolumeState& v : volumes) {
+      if (v.drive != d.index || v.node == 0) continue;
+      for (const Interface& i : interfaces) {
+        if (i.node == v.node) queued.push_back({kRemoveComplete, InterfaceRecord(i)});
+      }
+      gone.insert(v.node);
+      v.node = 0;
+      v.lockOwner = nullptr;
+      if (v.spec.letter >= 'A' && v.spec.letter <= 'Z') mask |= 1u << (v.spec.letter - 'A');
+    }
+  }
+  if (mask != 0) queued.push_back({kRemoveComplete, VolumeRecord(mask)});
+  std::reverse(queued.begin(), queued.end());
+  QueueEvents(std::move(queued));
+
+  interfaces.erase(std::remove_if(interfaces.begin(), interfaces.end(),
+                                  [&](const Interface& i) { return gone.count(i.node) != 0; }),
+                   interfaces.end());
+  for (DEVINST id : gone) nodes.erase(id);
+  d.nodes.erase(std::remove_if(d.nodes.begin(), d.nodes.end(),
+                               [&](DEVINST id) { return gone.count(id) != 0; }),
+                d.nodes.end());
+  for (SimFile* f : files) {
+    if (f->drive == d.index && goneEndpoints.count(f->endpoint) != 0) {
+      f->gone = true;
+      f->goneError = ERROR_DEVICE_NOT_CONNECTED;
+    }
+  }
+  auto keep = std::stable_partition(held.begin(), held.end(), [&](const HeldRequest& h) {
+    return h.file->drive != d.index || goneEndpoints.count(h.file->endpoint) == 0;
+  });
+  std::vector<HeldRequest> taken(std::make_move_iterator(keep),
+                                 std::make_move_iterator(held.end()));
+  held.erase(keep, held.end());
+  changed.notify_all();
+  return taken;
 }
 
 std::vector<HeldRequest> Machine::State::TakeDriveRequests(int drive, DWORD error) {

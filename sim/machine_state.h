@@ -39,6 +39,9 @@ struct Node {
 struct Interface {
   GUID interfaceClass{};
   std::u16string path;
+  // The name a device event carries: the instance ID in its own case (the
+  // list's path is lower case), as Windows writes dbcc_name.
+  std::u16string eventName;
   DEVINST node = 0;
   int drive = -1;
   bool openable = false;
@@ -77,7 +80,10 @@ struct VolumeState {
   VolumeSpec spec;
   int drive = -1;  // -1: a volume of no drive of the maker
   bool heldOpen = false;
-  bool mediumFails = false;
+  DWORD mediumError = 0;  // IOCTL_STORAGE_CHECK_VERIFY fails with it
+  DWORD lockError = 0;    // FSCTL_LOCK_VOLUME fails with it
+  DWORD dismountError = 0;
+  bool mounted = true;
   int dismounts = 0;
   const SimFile* lockOwner = nullptr;
   DEVINST node = 0;
@@ -120,6 +126,7 @@ struct Machine::State {
   std::vector<std::unique_ptr<DriveState>> drives;
   std::vector<DriveSpec> foreignDisks;
   std::vector<std::uint32_t> foreignDiskNumbers;
+  Language language = Language::English;
   std::vector<VolumeState> volumes;
   std::uint32_t nextDiskNumber = 1;
   std::vector<Command> commands;
@@ -158,6 +165,11 @@ struct Machine::State {
   // Builds a drive's nodes and interfaces (on attach).
   void BuildDriveNodes(DriveState& drive);
   void RemoveDriveNodes(DriveState& drive);
+  // Removes the node and everything below it (the drive's volumes go with
+  // its disk); the drive stays attached when something of it is left.
+  // Returns the requests to complete with ERROR_DEVICE_NOT_CONNECTED.
+  std::vector<HeldRequest> RemoveSubtree(DriveState& drive, DEVINST top);
+  bool DiskPresent(const DriveState& drive) const;
   // Moves every held request of the drive's files out, marking them gone.
   std::vector<HeldRequest> TakeDriveRequests(int drive, DWORD error);
   void ScheduleLateCompletion(TimedCompletion completion);
@@ -186,6 +198,8 @@ bool EqualNoCase(std::u16string_view a, std::u16string_view b);
 std::string GuidText(const GUID& guid);  // "{53F56307-B6BF-11D0-94F2-00A0C91EFB8B}"
 // "\\?\" + the instance ID with '\' as '#', lower case, + "#" + class, lower case.
 std::u16string InterfacePath(std::u16string_view instanceId, const GUID& interfaceClass);
+// The same path with the instance ID in its own case, as device events carry it.
+std::u16string InterfaceEventName(std::u16string_view instanceId, const GUID& interfaceClass);
 std::string HexOfText(std::string_view text);
 std::string TrimAscii(std::string_view text);
 // The unit serial of a drive (page 0x80 and the USB serial's source).

@@ -55,6 +55,14 @@ std::u16string InterfacePath(std::u16string_view instanceId, const GUID& interfa
   return LowerAscii(path);
 }
 
+std::u16string InterfaceEventName(std::u16string_view instanceId, const GUID& interfaceClass) {
+  std::u16string name = u"\\\\?\\";
+  for (char16_t c : instanceId) name.push_back(c == u'\\' ? u'#' : c);
+  name += u"#";
+  name += LowerAscii(Widen(GuidText(interfaceClass)));
+  return name;
+}
+
 std::string HexOfText(std::string_view text) {
   std::string out;
   char pair[3];

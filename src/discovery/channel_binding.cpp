@@ -4,6 +4,8 @@
 
 #include <cstring>
 
+#include "discovery/disk_number.h"
+#include "discovery/model_table.h"
 #include "monitor/monitor_state.h"
 #include "platform/wide.h"
 
@@ -16,15 +18,16 @@ bool RecordMatches(const ChannelRecord& channel, const DriveRecord& drive) {
   const bool haveTail = channel.instanceTail[0] != 0;
   if (channel.mode == kChannelModeEnclosure) {
     return haveTail && (WideEqual(drive.instanceKey, channel.instanceTail) ||
-                        WideContains(drive.deviceIdUpper, channel.instanceTail));
+                        ContainsComponent(drive.deviceIdUpper, channel.instanceTail));
   }
   if (channel.kind == kChannelKindHid) {
-    return channel.identityText[0] != 0 && WideContains(drive.deviceIdUpper, channel.identityText);
+    return channel.identityText[0] != 0 &&
+           ContainsComponent(drive.deviceIdUpper, channel.identityText);
   }
   if (channel.kind == kChannelKindDriver) {
-    if (haveTail && WideContains(drive.parentDeviceId, channel.instanceTail)) return true;
+    if (haveTail && ContainsComponent(drive.parentDeviceId, channel.instanceTail)) return true;
     return WideLength(channel.serialKey, 128) >= kMinSerialKeyLength &&
-           WideContains(drive.instanceKey, channel.serialKey);
+           ContainsComponent(drive.instanceKey, channel.serialKey);
   }
   return false;
 }
@@ -131,6 +134,7 @@ LONG Bind(StateBlock* block, ChannelRecord* channel, DriveRecord* recordCopy, BY
   // The slot may hold the uncounted 64th candidate of the enumeration; none
   // of that disk's fields belong to this drive.
   std::memset(drive, 0, sizeof(*drive));
+  SetDiskNumberRead(index, false);
   FillFromChannel(channel, drive, index);
   if (recordCopy != nullptr) *recordCopy = *drive;
   return index;

@@ -55,21 +55,33 @@ bool Classify(const WCHAR* id, Classification* out) {
   return false;
 }
 
+// A node property as text; empty when it cannot be read.
+void NodeText(DEVINST node, ULONG property, WCHAR (&text)[257]) {
+  ULONG length = 512;
+  if (CM_Get_DevNode_Registry_PropertyW(node, property, nullptr, text, &length, 0) != CR_SUCCESS) {
+    text[0] = 0;
+  }
+  text[256] = 0;
+}
+
+// The composite USB device: described so in English, or, since descriptions
+// follow the system's language, served by the composite device driver.
+bool IsCompositeDevice(DEVINST node) {
+  WCHAR text[257] = {};
+  NodeText(node, CM_DRP_DEVICEDESC, text);
+  if (WideContains(text, WSTR("USB")) && WideContains(text, WSTR("Composite Device"))) return true;
+  NodeText(node, CM_DRP_SERVICE, text);
+  return WideEqualNoCase(text, WSTR("usbccgp"));
+}
+
 // The serial number of the composite USB device above an HID collection:
-// the tail of the first ancestor described as a USB composite device, or of
-// the topmost ancestor when none is.
+// the tail of the first ancestor that is a USB composite device, or of the
+// topmost ancestor when none is.
 void HidSerialKey(DEVINST device, WCHAR* key, std::size_t capacity) {
   DEVINST node = 0;
   if (CM_Get_Parent(&node, device, 0) != CR_SUCCESS) return;
   for (;;) {
-    WCHAR description[257] = {};
-    ULONG length = 512;
-    if (CM_Get_DevNode_Registry_PropertyW(node, CM_DRP_DEVICEDESC, nullptr, description, &length,
-                                          0) == CR_SUCCESS &&
-        WideContains(description, WSTR("USB")) &&
-        WideContains(description, WSTR("Composite Device"))) {
-      break;
-    }
+    if (IsCompositeDevice(node)) break;
     DEVINST parent = 0;
     if (CM_Get_Parent(&parent, node, 0) != CR_SUCCESS) break;
     node = parent;

@@ -1,6 +1,7 @@
 #include "discovery/control_interface.h"
 
 #include "discovery/device_interfaces.h"
+#include "discovery/model_table.h"
 #include "platform/wide.h"
 
 namespace {
@@ -15,12 +16,12 @@ bool GrandparentCarriesKey(DEVINST device, const WCHAR* lowerKey) {
   if (CM_Get_Parent(&grandparent, parent, 0) != CR_SUCCESS) return false;
   if (!ReadNodeInstanceId(grandparent, id, 512)) return false;
   WideToLower(id);
-  return WideContains(id, lowerKey);
+  return ContainsComponent(id, lowerKey);
 }
 
 bool StoragePathCarriesKey(const WCHAR* path, const WCHAR* lowerKey) {
   if (!WideContains(path, WSTR("qx")) || !WideContains(path, WSTR("quarry")) ||
-      !WideContains(path, lowerKey)) {
+      !ContainsComponent(path, lowerKey)) {
     return false;
   }
   return (WideContains(path, WSTR("usbstor")) && WideContains(path, WSTR("other"))) ||

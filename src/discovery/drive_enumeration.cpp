@@ -17,6 +17,13 @@
 
 namespace {
 
+// The disk numbers read, per working record, and the block they belong to.
+struct DiskNumbersRead {
+  const StateBlock* block = nullptr;
+  bool read[kMaxDrives] = {};
+};
+DiskNumbersRead diskNumbersRead;
+
 constexpr LONG kCountedDriveLimit = kMaxDrives - 1;  // the 64th slot is scratch
 constexpr DWORD kBusUsb = 2;
 constexpr DWORD kBusIeee1394 = 3;
@@ -163,7 +170,7 @@ bool IdentifyDisk(HANDLE disk, DriveRecord* slot, HANDLE cancelEvent) {
 
 // Examines one disk interface into the slot; true when it was accepted.
 bool ReadCandidate(HDEVINFO list, const WideString& path, SP_DEVINFO_DATA* devInfo, LONG count,
-                   DriveRecord* slot, HANDLE cancelEvent, bool* counted) {
+                   DriveRecord* slot, HANDLE cancelEvent, bool* counted, bool* numbered) {
   const DWORD busKind = ClassifyDiskPath(path.c_str());
   if (busKind == 0) return false;
   slot->busKind = busKind;
@@ -211,10 +218,11 @@ bool ReadCandidate(HDEVINFO list, const WideString& path, SP_DEVINFO_DATA* devIn
 
   STORAGE_DEVICE_NUMBER number{};
   DWORD bytes = 0;
-  const bool numbered = IoControlWait(disk.Get(), IOCTL_STORAGE_GET_DEVICE_NUMBER, nullptr, 0,
-                                      &number, sizeof(number), &bytes, cancelEvent) &&
-                        bytes >= sizeof(number);
-  slot->diskNumber = numbered ? number.DeviceNumber : kUnknownDiskNumber;
+  const bool numberRead = IoControlWait(disk.Get(), IOCTL_STORAGE_GET_DEVICE_NUMBER, nullptr, 0,
+                                        &number, sizeof(number), &bytes, cancelEvent) &&
+                          bytes >= sizeof(number);
+  slot->diskNumber = numberRead ? number.DeviceNumber : kUnknownDiskNumber;
+  *numbered = numberRead;
   slot->volumeCount = 0;
 
   if (!IdentifyDisk(disk.Get(), slot, cancelEvent)) return false;
@@ -242,6 +250,20 @@ bool ReadCandidate(HDEVINFO list, const WideString& path, SP_DEVINFO_DATA* devIn
 
 }  // namespace
 
+void SetDiskNumberRead(LONG index, bool read) {
+  if (index < 0 || index >= kMaxDrives) return;
+  if (diskNumbersRead.block != monitorState.stateBlock) {
+    diskNumbersRead = DiskNumbersRead{};
+    diskNumbersRead.block = monitorState.stateBlock;
+  }
+  diskNumbersRead.read[index] = read;
+}
+
+bool DiskNumberRead(LONG index) {
+  return index >= 0 && index < kMaxDrives && diskNumbersRead.block == monitorState.stateBlock &&
+         diskNumbersRead.read[index];
+}
+
 LONG EnumerateDrives(HANDLE cancelEvent) {
   StateBlock* block = monitorState.stateBlock;
   if (block == nullptr) return -1;
@@ -250,6 +272,7 @@ LONG EnumerateDrives(HANDLE cancelEvent) {
   block->driveCount = 0;
   block->countedDrives = 0;
   block->publishedCount = 0;
+  for (LONG i = 0; i < kMaxDrives; ++i) SetDiskNumberRead(i, false);
 
   InterfaceList list(kDiskInterfaceClass);
   if (!list.Opened()) return -1;
@@ -265,9 +288,12 @@ LONG EnumerateDrives(HANDLE cancelEvent) {
     const LONG count = block->driveCount;
     DriveRecord candidate{};
     bool counted = false;
-    if (!ReadCandidate(list.Get(), path, &devInfo, count, &candidate, cancelEvent, &counted))
+    bool numbered = false;
+    if (!ReadCandidate(list.Get(), path, &devInfo, count, &candidate, cancelEvent, &counted,
+                       &numbered))
       continue;
     block->drives[count] = candidate;
+    SetDiskNumberRead(count, numbered);
     if (counted) block->countedDrives += 1;
     if (block->driveCount < kCountedDriveLimit) block->driveCount += 1;
     result = 0;

@@ -5,6 +5,7 @@
 namespace {
 
 const WCHAR kRambler[] = WSTR("Rambler");
+constexpr std::size_t kMaxMatchedText = 1024;
 
 // Each list ends with an empty entry.
 const WCHAR* const kChannelModels[] = {WSTR("C12"),
@@ -51,15 +52,40 @@ const ModelRow kModelTable[kModelRowCount + 1] = {
 bool LookupModelRow(const WCHAR* text, ModelRow* row) {
   if (text == nullptr) return false;
   const bool bareCode = WideLength(text) < 5;
+  // A longer text is a device ID or interface path; Windows spells paths in
+  // lower case and IDs in upper case, and means the same by both, so the
+  // text is matched in upper case, as the suffixes are written.
+  WCHAR upper[kMaxMatchedText] = {};
+  if (!bareCode) {
+    WideCopy(upper, kMaxMatchedText, text);
+    WideToUpper(upper);
+  }
   for (const ModelRow* candidate = kModelTable; candidate->suffix[0] != 0; ++candidate) {
     const bool match =
-        bareCode ? WideContains(candidate->suffix, text) : WideContains(text, candidate->suffix);
+        bareCode ? WideContains(candidate->suffix, text) : WideContains(upper, candidate->suffix);
     if (match) {
       *row = *candidate;
       return true;
     }
   }
   return false;
+}
+
+bool ContainsComponent(const WCHAR* text, const WCHAR* key) {
+  if (text == nullptr || key == nullptr || key[0] == 0) return false;
+  const std::size_t keyLength = WideLength(key);
+  auto separator = [](WCHAR ch) { return ch == WSTR('\\') || ch == WSTR('#') || ch == WSTR('&'); };
+  for (std::size_t start = 0;;) {
+    std::size_t end = start;
+    while (text[end] != 0 && !separator(text[end])) ++end;
+    if (end - start == keyLength) {
+      std::size_t i = 0;
+      while (i < keyLength && text[start + i] == key[i]) ++i;
+      if (i == keyLength) return true;
+    }
+    if (text[end] == 0) return false;
+    start = end + 1;
+  }
 }
 
 bool IsChannelModel(const WCHAR* text) {

@@ -39,3 +39,9 @@ bool IsStandaloneChannelModel(const WCHAR* text);
 // capacity - 1 and fewer than maxChars units are written and the byte is not
 // 0. dest is always terminated (when capacity > 0); returns the units copied.
 DWORD CopyAsciiToWide(WCHAR* dest, DWORD capacity, const BYTE* source, DWORD maxChars);
+
+// True when `key` (not empty) is a whole component of `text`: a run between
+// the separators of device IDs and interface paths ('\\', '#', '&') or the
+// text's ends. Keys of drives are compared so, never as bare substrings, so
+// that a short key cannot match inside another drive's ID.
+bool ContainsComponent(const WCHAR* text, const WCHAR* key);

@@ -8,6 +8,7 @@
 #include "monitor/state_lock.h"
 #include "platform/wide.h"
 #include "transport/drive_command.h"
+#include "transport/io_block.h"
 #include "transport/pass_through.h"
 #include "volume/volume_letters.h"
 
@@ -64,6 +65,7 @@ BYTE ReadButtonEvent(ChannelRecord* channel) {
   DWORD error = ERROR_SUCCESS;
   bool completed = false;  // a read finished: the result comes from its buffer
   bool pending = false;    // a read is still outstanding on the handle
+  IoBlock* block = nullptr;
 
   if (enclosure) {
     const DWORD status =
@@ -79,14 +81,23 @@ BYTE ReadButtonEvent(ChannelRecord* channel) {
       }
     }
   } else {
+    // The read runs on a heap block of its own: a stop gives it up after the
+    // cancellation grace, and a device that completes it later writes into
+    // the block, never into this frame.
+    block = NewIoBlock(kHidEventReportLength);
+    if (block == nullptr) {
+      CloseHandle(ownEvent);
+      return kNoButtonEvent;
+    }
     DWORD bytes = 0;
     BOOL started;
     if (hid) {
-      started = ReadFile(device, report, kHidEventReportLength, &bytes, &overlapped);
+      started = ReadFile(device, block->Data(), kHidEventReportLength, &bytes, &block->overlapped);
     } else {
       const DWORD code = channel->mode == kChannelModeGauge ? CTL_WAIT_GAUGE_EVENT : CTL_WAIT_EVENT;
-      started = DeviceIoControl(device, code, nullptr, 0, &controlOutput, sizeof(controlOutput),
-                                &bytes, &overlapped);
+      std::memcpy(block->Data(), &controlOutput, sizeof(controlOutput));
+      started = DeviceIoControl(device, code, nullptr, 0, block->Data(), sizeof(controlOutput),
+                                &bytes, &block->overlapped);
     }
     if (started) {
       completed = true;
@@ -96,20 +107,23 @@ BYTE ReadButtonEvent(ChannelRecord* channel) {
     }
     while (pending) {
       if (Signalled(stopEvent)) break;
-      const DWORD wait = WaitForSingleObject(ownEvent, kWaitSliceMs);
+      const DWORD wait = WaitForSingleObject(block->event, kWaitSliceMs);
       if (wait == WAIT_TIMEOUT) continue;
       if (wait == WAIT_OBJECT_0) {
         // The byte comes from the buffer whatever the outcome; the outcome
         // only tells the caller whether the device is still there.
         pending = false;
         completed = true;
-        error = GetOverlappedResult(device, &overlapped, &bytes, FALSE) ? ERROR_SUCCESS
-                                                                        : GetLastError();
+        error = GetOverlappedResult(device, &block->overlapped, &bytes, FALSE) ? ERROR_SUCCESS
+                                                                               : GetLastError();
         break;
       }
       error = GetLastError();
-      SettleCancelledRequest(device, &overlapped);
-      pending = false;
+      break;  // the wait itself failed: the read is given up below
+    }
+    if (completed) {
+      std::memcpy(report, block->Data(), kHidEventReportLength);
+      std::memcpy(&controlOutput, block->Data(), sizeof(controlOutput));
     }
   }
 
@@ -123,8 +137,14 @@ BYTE ReadButtonEvent(ChannelRecord* channel) {
       result = static_cast<BYTE>(controlOutput & 0xFF);
     }
   }
-  // Only a stop leaves the read outstanding; it must end before its buffers go.
-  if (pending) SettleCancelledRequest(device, &overlapped);
+  // A stop (or a failed wait) leaves the read outstanding: it is given up.
+  if (block != nullptr) {
+    if (pending) {
+      AbandonIoBlock(device, block);
+    } else {
+      FreeIoBlock(block);
+    }
+  }
   CloseHandle(ownEvent);
   SetLastError(error);
   return result;

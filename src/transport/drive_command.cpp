@@ -6,6 +6,7 @@
 #include "discovery/model_table.h"
 #include "monitor/monitor_state.h"
 #include "transport/button_events.h"
+#include "transport/io_block.h"
 #include "transport/pass_through.h"
 
 namespace {
@@ -64,15 +65,28 @@ bool CarriesNoInput(DWORD code) {
   }
 }
 
-// Waits briefly for a HID write or driver control started on `device`.
-bool AwaitCompletion(HANDLE device, BOOL startedOk, OVERLAPPED* overlapped) {
-  if (startedOk) return true;
-  if (GetLastError() != ERROR_IO_PENDING) return false;
-  if (WaitForSingleObject(overlapped->hEvent, kCommandCompletionMs) == WAIT_OBJECT_0) {
-    DWORD bytes = 0;
-    return GetOverlappedResult(device, overlapped, &bytes, FALSE) != FALSE;
+// Waits briefly for a HID write or driver control started on the block's
+// record; a request that does not complete in time is given up.
+bool AwaitCompletion(HANDLE device, BOOL startedOk, IoBlock* block) {
+  if (startedOk) {
+    FreeIoBlock(block);
+    return true;
   }
-  SettleCancelledRequest(device, overlapped);
+  const DWORD error = GetLastError();
+  if (error != ERROR_IO_PENDING) {
+    FreeIoBlock(block);
+    SetLastError(error);
+    return false;
+  }
+  if (WaitForSingleObject(block->event, kCommandCompletionMs) == WAIT_OBJECT_0) {
+    DWORD bytes = 0;
+    const bool ok = GetOverlappedResult(device, &block->overlapped, &bytes, FALSE) != FALSE;
+    const DWORD result = GetLastError();
+    FreeIoBlock(block);
+    SetLastError(result);
+    return ok;
+  }
+  AbandonIoBlock(device, block);
   SetLastError(ERROR_OPERATION_ABORTED);
   return false;
 }
@@ -150,30 +164,33 @@ bool SendToEnclosure(HANDLE device, DWORD code, WORD value, HANDLE ownEvent, HAN
          ERROR_SUCCESS;
 }
 
-bool SendHidReport(const ChannelRecord* channel, HANDLE device, WORD value, HANDLE ownEvent) {
+bool SendHidReport(const ChannelRecord* channel, HANDLE device, WORD value) {
   if (channel->mode == kChannelModeGauge) value = TranslateHidCommandValue(value);
   ModelRow row{};
   const bool withReportId =
       LookupModelRow(channel->devicePath, &row) && (row.flags & kModelFlagExtendedIdentity) != 0;
-  const BYTE report[5] = {static_cast<BYTE>(withReportId ? 0x01 : 0x00),
-                          static_cast<BYTE>(value & 0xFF), static_cast<BYTE>(value >> 8), 0x00,
-                          0x00};
-  OVERLAPPED overlapped{};
-  overlapped.hEvent = ownEvent;
+  IoBlock* block = NewIoBlock(5);
+  if (block == nullptr) return false;
+  BYTE* report = block->Data();
+  report[0] = static_cast<BYTE>(withReportId ? 0x01 : 0x00);
+  report[1] = static_cast<BYTE>(value & 0xFF);
+  report[2] = static_cast<BYTE>(value >> 8);
   DWORD written = 0;
-  const BOOL ok = WriteFile(device, report, withReportId ? 5 : 3, &written, &overlapped);
-  return AwaitCompletion(device, ok, &overlapped);
+  const BOOL ok = WriteFile(device, report, withReportId ? 5 : 3, &written, &block->overlapped);
+  return AwaitCompletion(device, ok, block);
 }
 
-bool SendDriverControl(HANDLE device, DWORD code, WORD value, HANDLE ownEvent) {
-  BYTE input[4] = {static_cast<BYTE>(value & 0xFF), static_cast<BYTE>(value >> 8), 0, 0};
+bool SendDriverControl(HANDLE device, DWORD code, WORD value) {
   const bool noInput = CarriesNoInput(code);
-  OVERLAPPED overlapped{};
-  overlapped.hEvent = ownEvent;
+  IoBlock* block = NewIoBlock(4);
+  if (block == nullptr) return false;
+  BYTE* input = block->Data();
+  input[0] = static_cast<BYTE>(value & 0xFF);
+  input[1] = static_cast<BYTE>(value >> 8);
   DWORD bytes = 0;
-  const BOOL ok = DeviceIoControl(device, code, noInput ? nullptr : input,
-                                  noInput ? 0 : sizeof(input), nullptr, 0, &bytes, &overlapped);
-  return AwaitCompletion(device, ok, &overlapped);
+  const BOOL ok = DeviceIoControl(device, code, noInput ? nullptr : input, noInput ? 0 : 4, nullptr,
+                                  0, &bytes, &block->overlapped);
+  return AwaitCompletion(device, ok, block);
 }
 
 WORD ByteValue(const BYTE* buffer, DWORD length) {
@@ -233,9 +250,9 @@ DWORD SendDriveCommand(ChannelRecord* channel, DWORD controlCode, WORD value, HA
   if (enclosure) {
     ok = SendToEnclosure(shared, controlCode, value, ownEvent.Get(), abortEvent);
   } else if (hid) {
-    ok = SendHidReport(channel, privateHid.Get(), value, ownEvent.Get());
+    ok = SendHidReport(channel, privateHid.Get(), value);
   } else {
-    ok = SendDriverControl(shared, controlCode, value, ownEvent.Get());
+    ok = SendDriverControl(shared, controlCode, value);
   }
   // The handles close in reverse order: the event, then the private HID handle.
   return ok ? 1 : 0;

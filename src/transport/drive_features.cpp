@@ -8,6 +8,7 @@
 #include "monitor/monitor_state.h"
 #include "platform/wide.h"
 #include "transport/drive_command.h"
+#include "transport/refresh_on_change.h"
 
 namespace {
 
@@ -81,11 +82,12 @@ WORD GaugePattern(DWORD usedPercent, DWORD segments) {
 
 void UpdateCapacityGauge(DriveRecord* drive, ChannelRecord* channel, HANDLE abortEvent) {
   if (drive == nullptr || channel == nullptr) return;
-  if (drive->volumeCount == 0 &&
-      (drive->extendedIdentity == 0 || (drive->extendedIdentity == 1 && drive->statusCode == 0))) {
-    // A drive without volumes: the list may be out of date.
-    RequestRefresh();
-  }
+  // A drive without volumes: the list may be out of date. One rescan is
+  // asked for when the drive is first seen so, none while it stays so.
+  NoteRefreshConditions(
+      drive, kRefreshNoVolumes,
+      drive->volumeCount == 0 && (drive->extendedIdentity == 0 ||
+                                  (drive->extendedIdentity == 1 && drive->statusCode == 0)));
   const DWORD used = UsedSpacePercent(drive);
   const WORD pattern = GaugePattern(used, drive->gaugeSegments);
 

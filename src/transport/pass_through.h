@@ -4,11 +4,11 @@
 //
 // Abort: when the abort event is signalled while a request is pending, the
 // handle's I/O is cancelled and 3000 ms are granted for the cancellation.
-// A device slow to cancel may still write into the request block, the
-// OVERLAPPED record and the data buffer after that grace, so the operation
-// then goes on waiting for the completion, without limit, before it frees
-// anything and returns. The port driver ends every pass-through at the
-// latest with its own command time-out, so the wait is bounded in practice.
+// Every request runs on a heap block of its own (OVERLAPPED record, event,
+// request and data buffers; io_block.h), so a device that has not finished
+// cancelling after the grace writes only into that block, which is set
+// aside, never into the caller's buffers: the operation returns after the
+// grace whatever the device does.
 #pragma once
 
 #include <cstddef>
@@ -31,6 +31,10 @@ static_assert(offsetof(PassThroughRequest, totalLength) == 56);
 static_assert(offsetof(PassThroughRequest, sense) == 60);
 
 constexpr DWORD kCancelGraceMs = 3000;
+// A command the drive answered with a SCSI status other than GOOD fails with
+// this application-defined code plus the status (0x20000002 for CHECK
+// CONDITION), as result and as the thread's last error.
+constexpr DWORD kScsiStatusErrorBase = 0x20000000;
 constexpr BYTE kInquiryLength = 74;
 
 // Issues the control with an own overlapped record and waits for it or for
@@ -39,7 +43,8 @@ constexpr BYTE kInquiryLength = 74;
 bool IoControlWait(HANDLE device, DWORD controlCode, void* input, DWORD inputLength, void* output,
                    DWORD outputLength, DWORD* bytesReturned, HANDLE abortEvent);
 
-// The SCSI commands. Each returns a Win32 error code, 0 on success.
+// The SCSI commands. Each returns a Win32 error code, 0 on success. Data the
+// drive returned short of the length asked for is zero-filled to it.
 // READ CAPACITY(10): both outputs in host order, written only on success.
 DWORD ScsiReadCapacity(HANDLE device, DWORD* lastLba, DWORD* blockLength, HANDLE abortEvent);
 // Standard INQUIRY into buffer[kInquiryLength].
@@ -47,8 +52,9 @@ DWORD ScsiInquiry(HANDLE device, BYTE* buffer, HANDLE abortEvent);
 // INQUIRY of a vital-product-data page into buffer[length].
 DWORD ScsiInquiryPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE length, HANDLE abortEvent);
 
-// The diagnostic pages, on the caller's overlapped record (its event may be
-// null for a handle opened without overlapped I/O). A transfer that was
+// The diagnostic pages. The caller's overlapped record must be given (its
+// event may be null for a handle opened without overlapped I/O); the
+// transfer runs on a record of its own. A transfer that was
 // started but did not complete successfully reports ERROR_IO_PENDING (997);
 // the thread's last error then tells the cause (995 after an abort).
 DWORD ReceiveDiagnosticPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE length,
@@ -56,10 +62,3 @@ DWORD ReceiveDiagnosticPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE len
 // buffer holds the whole page, header included.
 DWORD SendDiagnosticPage(HANDLE device, const BYTE* buffer, BYTE length, OVERLAPPED* overlapped,
                          HANDLE abortEvent);
-
-// Cancels the calling thread's I/O on the handle and returns only once the
-// request on `overlapped` has really completed (a grace wait on its event
-// first, then without limit), because the device may write into the
-// request's buffers until it completes. Every transport that abandons a
-// pending request uses it.
-void SettleCancelledRequest(HANDLE device, OVERLAPPED* overlapped);

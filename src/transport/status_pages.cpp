@@ -7,6 +7,7 @@
 #include "monitor/monitor_state.h"
 #include "platform/wide.h"
 #include "transport/pass_through.h"
+#include "transport/refresh_on_change.h"
 
 namespace {
 
@@ -40,7 +41,8 @@ DWORD FailureCode(DWORD error) {
 }
 
 // Opens the drive's control interface, or its HID collection for a USB drive,
-// synchronously. A drive that cannot be opened asks for a rescan, except a
+// synchronously. A drive that cannot be opened asks for a rescan (once, while
+// it stays so), except a
 // drive already bound to its channel that simply has neither interface (an
 // IEEE 1394 drive reached through the button filter driver): a rescan would
 // find it the same way, so asking would only rescan for ever.
@@ -61,7 +63,7 @@ OpenedDrive OpenDrive(const DriveRecord* drive) {
     return opened;
   } else {
     opened.error = GetLastError();
-    RequestRefresh();
+    NoteRefreshConditions(drive, kRefreshNoStatusPath, true);
     return opened;
   }
   opened.handle =
@@ -69,7 +71,10 @@ OpenedDrive OpenDrive(const DriveRecord* drive) {
                   OPEN_EXISTING, 0, nullptr);
   if (opened.handle == INVALID_HANDLE_VALUE) {
     opened.error = FailureCode(GetLastError());
-    RequestRefresh();
+    NoteRefreshConditions(drive, kRefreshOpenFails, true);
+    SetLastError(opened.error);
+  } else {
+    NoteRefreshConditions(drive, kRefreshNoStatusPath | kRefreshOpenFails, false);
   }
   return opened;
 }

@@ -6,6 +6,8 @@
 
 namespace {
 
+constexpr DWORD kErrorNoMediaInDrive = 1112;  // ERROR_NO_MEDIA_IN_DRIVE
+
 bool PlainControl(HANDLE volume, DWORD code) {
   DWORD bytes = 0;
   const BOOL ok = DeviceIoControl(volume, code, nullptr, 0, nullptr, 0, &bytes, nullptr);
@@ -42,7 +44,14 @@ int DismountVolume(WCHAR letter) {
 }
 
 int LockAndDismount(HANDLE volume) {
-  if (!PlainControl(volume, IOCTL_STORAGE_CHECK_VERIFY)) {
+  DWORD bytes = 0;
+  if (!DeviceIoControl(volume, IOCTL_STORAGE_CHECK_VERIFY, nullptr, 0, nullptr, 0, &bytes,
+                       nullptr)) {
+    const DWORD error = GetLastError();
+    if (error != ERROR_NOT_READY && error != kErrorNoMediaInDrive) {
+      // Anything but a missing medium may leave the volume mounted.
+      return 0;
+    }
     // No medium to take offline: done, but the drive list no longer holds.
     monitorState.driveListStale = 1;
     return 1;

@@ -10,9 +10,11 @@ constexpr DWORD kDismountRetryPauseMs = 1000;
 // 1 when every volume of the drive was taken offline (or it has none), 0 at
 // the first volume that stays online.
 int DismountDriveVolumes(const DriveRecord* drive);
-// 1 when the volume of the letter was taken offline or its medium check
-// failed (the drive list is then marked stale), else 0.
+// 1 when the volume of the letter was taken offline or holds no medium (the
+// drive list is then marked stale), else 0.
 int DismountVolume(WCHAR letter);
 // Medium check, lock, dismount, unlock on an open volume; nonzero on
-// success. A failed lock or dismount costs a pause of 1000 ms.
+// success or when the medium check finds no medium (not ready, no media);
+// any other failure of the check fails. A failed lock or dismount costs a
+// pause of 1000 ms.
 int LockAndDismount(HANDLE volume);

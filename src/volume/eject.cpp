@@ -41,14 +41,6 @@ void ReadServiceName(DEVINST node, WCHAR (&name)[kServiceNameBytes / sizeof(WCHA
   name[kServiceNameBytes / sizeof(WCHAR)] = 0;
 }
 
-void ReopenChannelHandle(ChannelRecord* channel) {
-  if (channel == nullptr) return;
-  const HANDLE device = CreateFileW(channel->devicePath, GENERIC_READ | GENERIC_WRITE,
-                                    FILE_SHARE_READ | FILE_SHARE_WRITE, nullptr, OPEN_EXISTING,
-                                    FILE_FLAG_OVERLAPPED, nullptr);
-  if (device != INVALID_HANDLE_VALUE) channel->deviceHandle = device;
-}
-
 // The veto of the last call, reset before each call so that an earlier
 // call's veto is never taken for the next one's.
 struct Veto {
@@ -95,9 +87,22 @@ bool EjectAttempt(HMODULE library, DEVINST node, DWORD capabilities) {
 
 }  // namespace
 
+void ReopenChannelDevice(ChannelRecord* channel) {
+  if (channel == nullptr) return;
+  const HANDLE device = CreateFileW(channel->devicePath, GENERIC_READ | GENERIC_WRITE,
+                                    FILE_SHARE_READ | FILE_SHARE_WRITE, nullptr, OPEN_EXISTING,
+                                    FILE_FLAG_OVERLAPPED, nullptr);
+  if (device != INVALID_HANDLE_VALUE) channel->deviceHandle = device;
+}
+
 int EjectDriveDevice(const DriveRecord* drive, ChannelRecord* channel) {
   WCHAR parentId[kIdCapacity] = {};
   WideCopy(parentId, kIdCapacity, drive->parentDeviceId);
+  // An empty ID would locate the root of the device tree.
+  if (parentId[0] == 0) {
+    SetLastError(ERROR_NOT_FOUND);
+    return 0;
+  }
   DEVINST node = 0;
   if (CM_Locate_DevNodeW(&node, parentId, CM_LOCATE_DEVNODE_NORMAL) != CR_SUCCESS) return 0;
 
@@ -127,7 +132,7 @@ int EjectDriveDevice(const DriveRecord* drive, ChannelRecord* channel) {
 
   const HMODULE library = LoadLibraryW(WSTR("setupapi.dll"));
   if (library == nullptr) {
-    if (reopen) ReopenChannelHandle(channel);
+    if (reopen) ReopenChannelDevice(channel);
     return 0;
   }
   bool ejected = false;
@@ -138,6 +143,6 @@ int EjectDriveDevice(const DriveRecord* drive, ChannelRecord* channel) {
   FreeLibrary(library);
 
   if (ejected) return 1;
-  if (reopen) ReopenChannelHandle(channel);
+  if (reopen) ReopenChannelDevice(channel);
   return 0;
 }

@@ -15,7 +15,12 @@ constexpr DWORD kEjectNoticePauseMs = 200;
 // The byte sent with CTL_EJECT_NOTICE before a parent node is ejected.
 constexpr BYTE kEjectNoticeValue = 0x20;
 
+// Opens the channel's device again (overlapped) after it was closed for a
+// removal that then failed; the handle stays null when the open fails.
+void ReopenChannelDevice(ChannelRecord* channel);
+
 // 1 when the Plug and Play manager accepted the removal of the drive's node
-// without a veto, else 0. Mutex held. A channel handle closed on the way is
-// opened again when the eject fails.
+// without a veto, else 0 (also, without any call, for an empty device
+// ID, which would name the root of the device tree). Mutex held. A channel handle closed on the way
+// is opened again when the eject fails.
 int EjectDriveDevice(const DriveRecord* drive, ChannelRecord* channel);

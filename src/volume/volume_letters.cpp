@@ -2,6 +2,7 @@
 // carries it, by the storage stack's device number.
 #include "volume/volume_letters.h"
 
+#include "discovery/disk_number.h"
 #include "monitor/monitor_state.h"
 
 namespace {
@@ -9,7 +10,9 @@ namespace {
 // The record of the disk with this device number, or null.
 DriveRecord* DriveOfDisk(StateBlock* block, DWORD diskNumber) {
   for (LONG i = 0; i < block->driveCount && i < kMaxDrives; ++i) {
-    if (block->drives[i].diskNumber == diskNumber) return &block->drives[i];
+    // A record whose number was never read matches no volume, whatever the
+    // volume reports.
+    if (DiskNumberRead(i) && block->drives[i].diskNumber == diskNumber) return &block->drives[i];
   }
   return nullptr;
 }

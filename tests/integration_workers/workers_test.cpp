@@ -147,6 +147,43 @@ TEST_F(WorkersTest, DefaultMachineLinksEveryChannelAndStaysSettled) {
   EXPECT_EQ(serialQueries, 2u) << "both HID channels read their identity once";
 }
 
+TEST_F(WorkersTest, DrivesThatStayIncompleteAskForOneRescanAtMost) {
+  // bare: linked to its HID channel, no volume and no extended identity, so
+  // every gauge pass finds it without letters. loose: extended identity, no
+  // channel and no control path, so no status pass can open it.
+  std::string text(sim::DefaultMachineText());
+  text += R"(
+drive bare
+  bus usb
+  channel hid
+  model-code 2A31
+  serial QX-8B4E2C19
+  rcs no
+end
+drive loose
+  bus 1394
+  channel none
+  model-code 5E22
+  serial QX-6C2D7E01
+  unit-model EXTERNAL_HDD
+  unit-id 0030E00000077E01
+  volume L fixed 100G 50G
+end
+)";
+  std::string error;
+  std::unique_ptr<sim::Machine> machine = sim::LoadMachine(text, &error);
+  ASSERT_NE(machine, nullptr) << error;
+  Install(std::move(machine));
+  Run([](const std::vector<Snapshot>& passes) {
+    std::size_t regular = 0;
+    for (const Snapshot& s : passes) regular += s.kind == PassKind::Regular ? 1 : 0;
+    return regular >= 120;
+  });
+  ASSERT_FALSE(snapshots_.empty());
+  EXPECT_LE(snapshots_.back().rescans, 2u) << "the start-up rescan and at most one more";
+  EXPECT_EQ(snapshots_.back().statusWord, 102u);
+}
+
 TEST_F(WorkersTest, PanelEventsOnAnUncountedMachineOnlyReportTheUncountedDrive) {
   // The plain drive is not of a channel model: the counted-drives check
   // reports it and holds back the panel actions.

@@ -386,7 +386,8 @@ TEST_F(DeviceIo, VanishingDeviceFailsPendingAndLaterRequests) {
     std::memcpy(&cls, &record[12], sizeof cls);
     if (cls != GUID_DEVINTERFACE_DISK) continue;
     std::u16string name(reinterpret_cast<const char16_t*>(&record[28]));
-    EXPECT_NE(name.find(u"sbp2#qx&external_hdd"), std::u16string::npos);
+    EXPECT_NE(name.find(u"SBP2#QX&EXTERNAL_HDD"), std::u16string::npos)
+        << "the instance ID's own case";
     (type == 0x8004 ? removedDisks : arrivedDisks) += 1;
   }
   EXPECT_EQ(removedDisks, 1);
@@ -505,10 +506,40 @@ TEST_F(DeviceIo, VolumesLockDismountAndFailAsConfigured) {
   EXPECT_EQ(OpenDevice("\\\\.\\E:", false), INVALID_HANDLE_VALUE);
   EXPECT_EQ(GetLastError(), ERROR_ACCESS_DENIED);
   EXPECT_TRUE(Control(volume, FSCTL_DISMOUNT_VOLUME, nullptr, 0, nullptr, 0));
+  EXPECT_FALSE(machine->VolumeMounted('E'));
   EXPECT_TRUE(Control(volume, FSCTL_UNLOCK_VOLUME, nullptr, 0, nullptr, 0));
   EXPECT_FALSE(machine->VolumeLocked('E'));
   EXPECT_EQ(machine->DismountCount('E'), 1);
+  EXPECT_FALSE(machine->VolumeMounted('E')) << "mounted again only when next used";
   EXPECT_TRUE(CloseHandle(volume));
+  volume = OpenDevice("\\\\.\\E:", false);
+  EXPECT_TRUE(machine->VolumeMounted('E'));
+  EXPECT_TRUE(CloseHandle(volume));
+
+  // Lock, dismount and medium check fail as told.
+  struct Failure {
+    DWORD code;
+    DWORD error;
+  };
+  for (const Failure& failure : {Failure{FSCTL_LOCK_VOLUME, ERROR_ACCESS_DENIED},
+                                 Failure{FSCTL_DISMOUNT_VOLUME, ERROR_SHARING_VIOLATION},
+                                 Failure{IOCTL_STORAGE_CHECK_VERIFY, 1117}}) {
+    if (failure.code == IOCTL_STORAGE_CHECK_VERIFY) {
+      machine->SetMediumCheckError('E', failure.error);
+    } else {
+      machine->SetVolumeControlError('E', failure.code, failure.error);
+    }
+    HANDLE e = OpenDevice("\\\\.\\E:", false);
+    DWORD error = 0;
+    EXPECT_TRUE(failure.code == FSCTL_LOCK_VOLUME ||
+                Control(e, FSCTL_LOCK_VOLUME, nullptr, 0, nullptr, 0));
+    EXPECT_FALSE(Control(e, failure.code, nullptr, 0, nullptr, 0, nullptr, &error));
+    EXPECT_EQ(error, failure.error);
+    EXPECT_TRUE(machine->VolumeMounted('E'));
+    EXPECT_TRUE(CloseHandle(e));
+    machine->SetVolumeControlError('E', failure.code, 0);
+    machine->SetMediumCheckError('E', 0);
+  }
 
   machine->SetVolumeHeldOpen('F', true);
   machine->SetMediumCheckFails('G', true);

@@ -138,6 +138,33 @@ TEST_F(Enumeration, UsbDisksCarryTheSerialOfTheirCompositeDevice) {
   }
 }
 
+// Descriptions follow the system's language; the composite device is known
+// by its service whatever the text says.
+TEST(LocalisedMachine, DescriptionsAreInTheSystemsLanguage) {
+  const struct {
+    const char* language;
+    const char* composite;
+  } cases[] = {
+      {"de", "USB-Verbundger\xC3\xA4t"},
+      {"ja", "USB \xE8\xA4\x87\xE5\x90\x88\xE3\x83\x87\xE3\x83\x90\xE3\x82\xA4\xE3\x82\xB9"}};
+  for (const auto& c : cases) {
+    std::string error;
+    auto machine = sim::LoadMachine(
+        std::string("language ") + c.language + "\ndrive one\n  bus usb\n  channel hid\nend\n",
+        &error);
+    ASSERT_TRUE(machine) << error;
+    machine->Install();
+    Found disk = DiskWith("usbstor");
+    const DEVINST composite = ParentOf(ParentOf(disk.devInst));
+    EXPECT_EQ(NodeText(composite, CM_DRP_DEVICEDESC), c.composite) << c.language;
+    EXPECT_EQ(NodeText(composite, CM_DRP_SERVICE), "usbccgp");
+    EXPECT_NE(NodeText(disk.devInst, CM_DRP_DEVICEDESC), "Disk drive") << c.language;
+    machine->Uninstall();
+  }
+  std::string error;
+  EXPECT_FALSE(sim::LoadMachine("language xx\n", &error));
+}
+
 TEST_F(Enumeration, HidCollectionsClassifyAndLeadToTheirDisk) {
   GUID hidClass{};
   HidD_GetHidGuid(&hidClass);

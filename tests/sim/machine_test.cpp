@@ -2,6 +2,8 @@
 // the OS version, description texts and machines built through the API.
 #include <gtest/gtest.h>
 
+#include <chrono>
+#include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
@@ -86,9 +88,15 @@ TEST_F(MachineTest, EjectIsVetoedThenSucceedsAndTheDriveGoes) {
   EXPECT_EQ(ejects[1].drive, "firewire");
   EXPECT_EQ(ejects[1].instanceId, unitId);
 
-  // The machine's own nodes cannot be removed.
+  // An empty ID, like none, names the root; the machine's own nodes cannot
+  // be removed.
   DEVINST root = 0;
   ASSERT_EQ(CM_Locate_DevNodeW(&root, nullptr, 0), CR_SUCCESS);
+  EXPECT_EQ(root, machine->RootNode());
+  WCHAR empty[1] = {0};
+  DEVINST located = 0;
+  ASSERT_EQ(CM_Locate_DevNodeW(&located, empty, CM_LOCATE_DEVNODE_NORMAL), CR_SUCCESS);
+  EXPECT_EQ(located, root);
   WCHAR wideName[260];
   EXPECT_EQ(CM_Query_And_Remove_SubTreeW(root, &vetoType, wideName, 260, 0), CR_REMOVE_VETOED);
   EXPECT_TRUE(FreeLibrary(setupapi));
@@ -107,6 +115,100 @@ TEST_F(MachineTest, AVolumeHeldOpenVetoesTheEject) {
   EXPECT_EQ(CM_Query_And_Remove_SubTreeW(function, &vetoType, name, 260, 0), CR_SUCCESS);
   EXPECT_FALSE(machine->Attached("plain"));
   EXPECT_EQ(GetLogicalDrives() & ((1u << ('F' - 'A')) | (1u << ('G' - 'A'))), 0u);
+}
+
+// The interface names device events carry, in delivery order.
+std::vector<std::string> EventNames(
+    const std::vector<std::pair<DWORD, std::vector<std::uint8_t>>>& events) {
+  std::vector<std::string> names;
+  for (const auto& [type, record] : events) {
+    if (record.size() <= 28 || record[4] != DBT_DEVTYP_DEVICEINTERFACE) continue;
+    names.push_back(Text(reinterpret_cast<const WCHAR*>(record.data() + 28)));
+  }
+  return names;
+}
+
+TEST_F(MachineTest, EjectRemovesOnlyTheSubtreeOfItsNode) {
+  Found disk = DiskWith("354d3842");  // the plain drive: volumes F and G
+  const DEVINST function = ParentOf(disk.devInst);
+  const DEVINST composite = ParentOf(function);
+  auto hidOfPlain = [] {
+    GUID hidClass;
+    HidD_GetHidGuid(&hidClass);
+    std::vector<Found> found;
+    for (const Found& f : ListInterfaces(hidClass)) {
+      if (Contains(f.instanceId, "PID_2A31")) found.push_back(f);
+    }
+    return found;
+  };
+  ASSERT_EQ(hidOfPlain().size(), 1u);
+  HANDLE hid = OpenDevice(hidOfPlain()[0].path, false);
+  ASSERT_NE(hid, INVALID_HANDLE_VALUE);
+
+  PNP_VETO_TYPE vetoType = PNP_VetoTypeUnknown;
+  WCHAR name[260] = {};
+  ASSERT_EQ(CM_Query_And_Remove_SubTreeW(function, &vetoType, name, 260, 0), CR_SUCCESS);
+  EXPECT_FALSE(machine->Attached("plain")) << "the disk went with its function";
+  EXPECT_EQ(GetLogicalDrives() & ((1u << ('F' - 'A')) | (1u << ('G' - 'A'))), 0u);
+  EXPECT_EQ(hidOfPlain().size(), 1u) << "the HID function stays";
+  EXPECT_EQ(DeviceId(ParentOf(ParentOf(hidOfPlain()[0].devInst))), DeviceId(composite));
+  BYTE report[16] = {2};
+  EXPECT_TRUE(HidD_GetInputReport(hid, report, sizeof report)) << "its handle still works";
+
+  // The events name the removed interfaces as Windows does: the instance ID
+  // in its own case, the class in lower case.
+  ASSERT_TRUE(machine->WaitForDeviceEvents());
+  std::vector<std::string> names;
+  {
+    std::lock_guard<std::mutex> lock(eventsMutex);
+    names = EventNames(events);
+  }
+  ASSERT_FALSE(names.empty());
+  bool diskNamed = false;
+  for (const std::string& n : names) {
+    EXPECT_FALSE(Contains(n, "HID#")) << n;
+    diskNamed = diskNamed || Contains(n, "USBSTOR#DISK&VEN_QX&PROD_");
+  }
+  EXPECT_TRUE(diskNamed);
+  EXPECT_TRUE(Contains(names.back(), "#{53f56307-b6bf-11d0-94f2-00a0c91efb8b}")) << names.back();
+
+  // The composite device takes the rest; attached again, the drive is whole.
+  ASSERT_EQ(CM_Query_And_Remove_SubTreeW(composite, &vetoType, name, 260, 0), CR_SUCCESS);
+  EXPECT_TRUE(hidOfPlain().empty());
+  EXPECT_FALSE(HidD_GetInputReport(hid, report, sizeof report));
+  EXPECT_TRUE(CloseHandle(hid));
+  machine->Attach("plain");
+  EXPECT_TRUE(machine->Attached("plain"));
+  EXPECT_EQ(hidOfPlain().size(), 1u);
+}
+
+TEST_F(MachineTest, DeviceEventsAreDeliveredOneAtATime) {
+  std::mutex gate;
+  std::condition_variable wake;
+  int delivered = 0;
+  bool release = false;
+  machine->SetDeviceEventSink([&](DWORD, const void*) {
+    std::unique_lock<std::mutex> lock(gate);
+    ++delivered;
+    wake.notify_all();
+    wake.wait(lock, [&] { return release; });
+  });
+  machine->Detach("plain");  // several interfaces and a volume record
+  {
+    std::unique_lock<std::mutex> lock(gate);
+    ASSERT_TRUE(wake.wait_for(lock, std::chrono::seconds(10), [&] { return delivered == 1; }));
+  }
+  // A handler that blocks holds up the next event.
+  EXPECT_FALSE(machine->WaitForDeviceEvents(200));
+  {
+    std::lock_guard<std::mutex> lock(gate);
+    EXPECT_EQ(delivered, 1);
+    release = true;
+  }
+  wake.notify_all();
+  ASSERT_TRUE(machine->WaitForDeviceEvents());
+  std::lock_guard<std::mutex> lock(gate);
+  EXPECT_GT(delivered, 2);
 }
 
 TEST_F(MachineTest, OsVersionIsTheMachines) {

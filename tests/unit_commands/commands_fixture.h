@@ -19,6 +19,7 @@
 #include "platform/wide.h"
 #include "service/process_locks.h"
 #include "support/channel_helpers.h"
+#include "transport/refresh_on_change.h"
 #include "volume/volume_letters.h"
 
 namespace cmdtest {
@@ -105,6 +106,7 @@ class CommandTest : public ::testing::Test {
  protected:
   void SetUp() override {
     InitializeProcessLocks();
+    ForgetRefreshConditions();
     monitorState = MonitorState{};
     monitorState.tick = 1;
     monitorState.osKind = kOsXpOrLater;

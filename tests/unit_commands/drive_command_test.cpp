@@ -6,6 +6,7 @@
 
 #include "commands_fixture.h"
 #include "support/test_support.h"
+#include "transport/io_block.h"
 
 namespace cmdtest {
 namespace {
@@ -20,14 +21,13 @@ TEST_F(DriveCommandTest, GaugeHidChannelTranslatesValuesAfterTheZeroTest) {
   EXPECT_EQ(SendDriveCommand(gauge, CTL_SET_GAUGE, 0x8100, nullptr), 1u);
   EXPECT_EQ(SendDriveCommand(gauge, CTL_SET_STATE, 2, nullptr), 1u);   // becomes 0, still sent
   EXPECT_EQ(SendDriveCommand(gauge, CTL_SET_STATE, 16, nullptr), 1u);  // becomes 4
+  // Model 7B44 carries flag 0x10: 5-byte reports with ID 1.
   EXPECT_EQ(HidReports("gauge"), (std::vector<Bytes>{
-                                     {0x00, 0x02, 0x00},
-                                     {0x00, 0x00, 0x81},
-                                     {0x00, 0x00, 0x00},
-                                     {0x00, 0x04, 0x00},
+                                     {0x01, 0x02, 0x00, 0x00, 0x00},
+                                     {0x01, 0x00, 0x81, 0x00, 0x00},
+                                     {0x01, 0x00, 0x00, 0x00, 0x00},
+                                     {0x01, 0x04, 0x00, 0x00, 0x00},
                                  }));
-  // The model row is looked up case-sensitively in the lower-case interface
-  // path, so this channel sends the short report without an ID.
 }
 
 TEST_F(DriveCommandTest, HidValueZeroSucceedsWithoutOpeningAnything) {
@@ -42,10 +42,9 @@ TEST_F(DriveCommandTest, HidValueZeroSucceedsWithoutOpeningAnything) {
 }
 
 TEST_F(DriveCommandTest, ReportIdFollowsTheModelRowOfTheInterfacePath) {
-  // An interface path spelled in capitals finds the row of model 5E24, whose
-  // flag asks for the 5-byte report with ID 1.
+  // The interface path, in lower case as the system lists it, finds the row
+  // of model 5E24, whose flag asks for the 5-byte report with ID 1.
   ChannelRecord* wide = Wide();
-  WideToUpper(wide->devicePath);
   EXPECT_EQ(SendDriveCommand(wide, CTL_SET_GAUGE, 0x8100, nullptr), 1u);
   // A plain channel sends the value untranslated.
   BYTE reply = 0x40;
@@ -160,6 +159,15 @@ TEST_F(DriveCommandTest, CommandThatDoesNotCompleteIsCancelledAndFails) {
   EXPECT_EQ(SendDriveCommand(Gauge(), CTL_SET_GAUGE, 0x8100, nullptr), 0u);
   EXPECT_EQ(machine_.PendingCount("gauge", sim::Endpoint::Hid), 0u);
   EXPECT_EQ(HidReports("gauge").size(), 1u) << "the report reached the device";
+
+  // A driver that never finishes the cancellation holds the sender only for
+  // the grace; the request is set aside until the driver completes it.
+  const std::size_t aside = SetAsideIoBlockCount();
+  machine_.SetCancelDelay("firewire", sim::Endpoint::Driver, INFINITE);
+  EXPECT_EQ(SendDriveCommand(FireWire(), CTL_SET_STATE, 1, nullptr), 0u);
+  EXPECT_EQ(SetAsideIoBlockCount(), aside + 1);
+  machine_.FinishHeldCancels();
+  EXPECT_EQ(SetAsideIoBlockCount(), aside);
 }
 
 TEST_F(DriveCommandTest, DispatcherRejectsCodesItDoesNotAccept) {

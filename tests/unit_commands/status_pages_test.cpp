@@ -138,7 +138,7 @@ TEST_F(StatusPagesTest, DriveThatDoesNotOpenAsksForARescan) {
   EXPECT_EQ(ReadDriveStatus(&drive, status), 0u);
   EXPECT_EQ(ReadSleepState(&drive, sleep), 3u);
   EXPECT_EQ(WriteDriveControl(&drive, control), 0xFFFFFFFFu);
-  EXPECT_EQ(monitorState.refreshRequests, 3u);
+  EXPECT_EQ(monitorState.refreshRequests, 1u) << "once while the drive stays so";
   EXPECT_EQ(monitorState.burstRequested, 1u);
   EXPECT_EQ(monitorState.gaugePassRequested, 1u);
   EXPECT_EQ(monitorState.sleepPassRequested, 1u);
@@ -147,7 +147,14 @@ TEST_F(StatusPagesTest, DriveThatDoesNotOpenAsksForARescan) {
   DriveRecord unbound{};
   unbound.busKind = 2;
   EXPECT_EQ(ReadDriveStatus(&unbound, status), 0u);
-  EXPECT_EQ(monitorState.refreshRequests, 4u);
+  EXPECT_EQ(monitorState.refreshRequests, 2u);
+
+  // Once the drive opened again, a new failure asks again.
+  machine_.ClearFaults();
+  ReadDriveStatus(&drive, status);  // opens
+  machine_.FailOpen("gauge", sim::Endpoint::Hid, ERROR_FILE_NOT_FOUND);
+  EXPECT_EQ(ReadDriveStatus(&drive, status), 0u);
+  EXPECT_EQ(monitorState.refreshRequests, 3u);
 }
 
 TEST_F(StatusPagesTest, BoundDriveWithoutStatusInterfaceDoesNotAskForRescans) {
@@ -170,7 +177,8 @@ TEST_F(StatusPagesTest, BoundDriveWithoutStatusInterfaceDoesNotAskForRescans) {
   DriveRecord unbound{};
   unbound.busKind = 3;
   EXPECT_EQ(ReadDriveStatus(&unbound, status), 0u);
-  EXPECT_EQ(monitorState.refreshRequests, 1u);
+  EXPECT_EQ(ReadDriveStatus(&unbound, status), 0u);
+  EXPECT_EQ(monitorState.refreshRequests, 1u) << "not again on every pass";
 }
 
 }  // namespace

@@ -57,8 +57,12 @@ TEST_F(ChannelTest, HidChannelsTakeModeAndCreationFromTheModelLists) {
   const sim::DriveSpec plain = HidDrive("plain", "2A31", "504C41494E");
   const sim::DriveSpec standalone = HidDrive("gauge", "7B44", "4741554745");
   const sim::DriveSpec listed = HidDrive("listed", "5E22", "4C49535445");
+  // The composite device is found whatever language its description is in.
+  machine_.SetLanguage(sim::Language::German);
   machine_.AddDrive(plain);
+  machine_.SetLanguage(sim::Language::English);
   machine_.AddDrive(standalone);
+  machine_.SetLanguage(sim::Language::Japanese);
   machine_.AddDrive(listed);
   // Someone's mouse: an HID collection of no listed model.
   const DEVINST mouse =
@@ -94,6 +98,7 @@ TEST_F(ChannelTest, HidChannelsTakeModeAndCreationFromTheModelLists) {
   // The serial key is the serial of the composite USB device above.
   EXPECT_EQ(N(gaugeChannel->serialKey), "4741554745");
   EXPECT_EQ(N(plainChannel->serialKey), "504C41494E");
+  EXPECT_EQ(N(listedChannel->serialKey), "4C49535445");
 }
 
 TEST_F(ChannelTest, EnclosureIsModeTwoKindThreeUnderAnyVendorClass) {
@@ -311,6 +316,32 @@ TEST_F(BindingRulesTest, DriverChannelMatchesOnlyThroughItsKeys) {
   ChannelRecord controlKind = MakeChannel(0, 0);  // kind 0 has no matching rule
   WideCopy(controlKind.instanceTail, 256, WSTR("0030E0000001A2B3"));
   EXPECT_EQ(BindChannelToDrive(&controlKind, nullptr, 0), -1);
+}
+
+TEST_F(BindingRulesTest, KeysMatchWholeComponentsOnly) {
+  // Drive 0's IDs carry the short keys inside longer components.
+  Block().driveCount = 2;
+  WideCopy(Drive(0).deviceIdUpper, 256, WSTR("USBSTOR\\DISK&VEN_QX\\15A3&0"));
+  WideCopy(Drive(0).parentDeviceId, 256, WSTR("1394\\QX&EXTERNAL_HDD\\00305&0"));
+  WideCopy(Drive(1).deviceIdUpper, 256, WSTR("USBSTOR\\DISK&VEN_QX\\5&0"));
+  WideCopy(Drive(1).parentDeviceId, 256, WSTR("1394\\QX&EXTERNAL_HDD\\5"));
+  WideCopy(Drive(1).instanceKey, 128, WSTR("5&0"));
+
+  ChannelRecord hid = MakeChannel(2, 0);
+  WideCopy(hid.identityText, 128, WSTR("5"));
+  EXPECT_EQ(BindChannelToDrive(&hid, nullptr, 0), 1);
+  ChannelRecord driver = MakeChannel(3, 0);
+  WideCopy(driver.instanceTail, 256, WSTR("5"));
+  EXPECT_EQ(BindChannelToDrive(&driver, nullptr, 0), 1);
+  ChannelRecord enclosure = MakeChannel(3, 2);
+  WideCopy(enclosure.instanceTail, 256, WSTR("5"));
+  EXPECT_EQ(BindChannelToDrive(&enclosure, nullptr, 0), 1);
+
+  // Without the drive that carries the key as a whole, nothing matches.
+  Block().driveCount = 1;
+  for (ChannelRecord* channel : {&hid, &driver, &enclosure}) {
+    EXPECT_EQ(BindChannelToDrive(channel, nullptr, 0), -1);
+  }
 }
 
 TEST_F(BindingRulesTest, CreatedRecordsReplaceTheScratchCandidateAndStopAt64) {

@@ -83,10 +83,19 @@ TEST_F(EnumerationTest, SerialTextOfOnlyThePrefixBecomesNaWithoutAsciiPages) {
   spec.vpdPages = {0x00, 0x80, 0x83, 0xC0};  // page list without 0x01 and 0x02
   spec.unitSerial = "UNITSER1";
   machine_.AddDrive(spec);
+  // Lists the ASCII pages but rejects page 0x80 (and lacks 0xC1): the
+  // serial text of the inquiry data stays.
+  sim::DriveSpec lacking = FireWireDrive("lacking", "5E24", "0030E0000000CA5E");
+  lacking.serial = "QX-4F2C11";
+  lacking.vpdPages = {0x00, 0x01, 0x02, 0xC0};
+  machine_.AddDrive(lacking);
   Install();
 
   EnumerateDrives(nullptr);
-  ASSERT_EQ(Block().driveCount, 1);
+  ASSERT_EQ(Block().driveCount, 2);
+  EXPECT_EQ(N(Drive(1).serialNumber), "4F2C11");
+  EXPECT_EQ(N(Drive(1).asciiInfo1), lacking.asciiInfo1);
+  EXPECT_EQ(Drive(1).vendorCode[0], 0);
   const DriveRecord& drive = Drive(0);
   EXPECT_EQ(drive.extendedIdentity, 1u);
   EXPECT_EQ(N(drive.serialNumber), "NA");  // page 0x80 is not read either

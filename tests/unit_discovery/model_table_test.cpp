@@ -20,7 +20,7 @@ TEST(ModelTableTest, BareCodesAndInstanceIdsSelectTheirRows) {
   EXPECT_EQ(SuffixOf(WSTR("USB\\VID_1A2B&PID_7B45&MI_00\\6&1&0&0000")), "_7B45");
   EXPECT_EQ(SuffixOf(WSTR("HID\\VID_1A2B&PID_3C13&MI_01\\7&2&0&0000")), "_3C13");
   EXPECT_EQ(SuffixOf(WSTR("_5E2X")), "none");  // five units: a text that holds no suffix
-  EXPECT_EQ(SuffixOf(WSTR("usb\\vid_1a2b&pid_7b45")), "none");  // case-sensitive
+  EXPECT_EQ(SuffixOf(WSTR("usb\\vid_1a2b&pid_7b45")), "_7B45");  // paths: any case
   EXPECT_EQ(SuffixOf(WSTR("9")), "_2A39");  // bare codes match inside suffixes, first row wins
 
   ModelRow row{};

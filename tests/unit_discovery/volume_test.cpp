@@ -55,13 +55,17 @@ TEST_F(VolumeTest, LettersOfTheDrivesVolumesInLetterOrder) {
 }
 
 TEST_F(VolumeTest, ADriveWithoutDiskNumberGetsNoLetters) {
+  // A volume that spans disks reports the number that stands for none.
+  sim::VolumeSpec spanned = Volume('S', DRIVE_FIXED);
+  spanned.diskNumber = 0xFFFFFFFF;
+  machine_.AddVolume(spanned);
   Build({Volume('E', DRIVE_FIXED)});
   machine_.FailIo("drive", sim::Endpoint::Disk, ERROR_NOT_READY, -1,
                   IOCTL_STORAGE_GET_DEVICE_NUMBER);
   EnumerateDrives(nullptr);
   ASSERT_EQ(Block().driveCount, 1);
   AssignVolumeLetters();
-  EXPECT_EQ(Drive(0).volumeCount, 0u);  // in particular not C: of disk 0
+  EXPECT_EQ(Drive(0).volumeCount, 0u);  // in particular not C: of disk 0, nor S:
   EXPECT_EQ(Drive(0).volumeLetters[0], 0);
 }
 

@@ -20,6 +20,7 @@
 #include "service/process_locks.h"
 #include "support/channel_helpers.h"
 #include "transport/button_events.h"
+#include "transport/refresh_on_change.h"
 #include "volume/volume_letters.h"
 
 namespace featuretest {
@@ -73,6 +74,7 @@ class FeatureTest : public ::testing::Test {
 
   void SetUp() override {
     InitializeProcessLocks();
+    ForgetRefreshConditions();
     monitorState = MonitorState{};
     monitorState.tick = 1;
     monitorState.osKind = kOsXpOrLater;

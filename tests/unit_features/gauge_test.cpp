@@ -182,6 +182,14 @@ TEST_F(GaugeTest, DriveWithoutVolumesAsksForARescan) {
   drive.extendedIdentity = 0;
   drive.statusCode = 5;
   UpdateCapacityGauge(&drive, lights, nullptr);
+  EXPECT_EQ(monitorState.refreshRequests, 1u) << "not again while the drive stays so";
+  // Once it had volumes, losing them again asks again.
+  drive.volumeCount = 1;
+  drive.volumeLetters[0] = WSTR('J');
+  UpdateCapacityGauge(&drive, lights, nullptr);
+  drive.volumeCount = 0;
+  drive.volumeLetters[0] = 0;
+  UpdateCapacityGauge(&drive, lights, nullptr);
   EXPECT_EQ(monitorState.refreshRequests, 2u);
   EXPECT_EQ(monitorState.burstRequested, 1u);
   EXPECT_EQ(monitorState.gaugePassRequested, 1u);

@@ -45,24 +45,88 @@ TEST_F(SafeRemovalTest, RemovesTheDriveAndUnlinksItsChannel) {
   EXPECT_TRUE(machine_.Attached("plain"));
 }
 
-TEST_F(SafeRemovalTest, WithoutDrivesTheEjectIsSkipped) {
+TEST_F(SafeRemovalTest, WithoutABoundDriveNothingIsTouched) {
+  // An empty drive list: nothing says the volumes are offline.
   ChannelRecord* plain = Plain();
+  const LONG linked = plain->linkedDrive;
+  DriveRecord copy = CopyOf(plain);
   Block().driveCount = 0;
-  ASSERT_EQ(Remove(plain), 1);
-  EXPECT_EQ(machine_.DismountCount('F'), 1);
-  EXPECT_TRUE(machine_.Ejects().empty());
-  EXPECT_TRUE(machine_.Attached("plain"));
-  EXPECT_EQ(HidValues("plain"), (std::vector<Bytes>{{0x04, 0x00}})) << "drive-gone state";
-  EXPECT_EQ(plain->linkedDrive, -1);
+  EXPECT_EQ(SafeRemoveDrive(&copy, plain), 0);
+  EXPECT_EQ(machine_.DismountCount('F'), 0);
+  EXPECT_TRUE(machine_.VolumeMounted('F'));
+  ExpectNotRemoved("plain", plain, linked);
+  Block().driveCount = 5;
 
-  // A USB drive bound to an enclosure-mode channel loses the channel's
-  // handle before its volumes are touched.
+  // The channel's disk dropped out of the list; the worker's scratch record
+  // is all zero.
+  machine_.FailOpen("plain", sim::Endpoint::Disk, ERROR_ACCESS_DENIED);
+  EnumerateDrives(nullptr);
+  AssignVolumeLetters();
+  DriveRecord zero{};
+  EXPECT_EQ(SafeRemoveDrive(&zero, plain), 0);
+  EXPECT_EQ(machine_.DismountCount('F'), 0);
+
+  // A record made from a channel has no device ID: the root of the device
+  // tree must never be asked to go.
   ChannelRecord* gauge = Gauge();
-  DriveRecord copy = CopyOf(gauge);
-  copy.channelMode = kChannelModeEnclosure;
-  ASSERT_EQ(SafeRemoveDrive(&copy, gauge), 1);
-  EXPECT_EQ(gauge->deviceHandle, nullptr);
-  EXPECT_EQ(machine_.OpenCount("gauge", sim::Endpoint::Hid), 0u);
+  machine_.FailOpen("gauge", sim::Endpoint::Disk, ERROR_ACCESS_DENIED);
+  EnumerateDrives(nullptr);
+  AssignVolumeLetters();
+  DriveRecord made{};
+  ASSERT_GE(BindChannelToDrive(gauge, &made, 1), 0);
+  ASSERT_EQ(made.fromChannel, 1u);
+  EXPECT_EQ(EjectDriveDevice(&made, gauge), 0);
+  EXPECT_EQ(SafeRemoveDrive(&made, gauge), 0);
+  EXPECT_TRUE(machine_.Ejects().empty());
+  EXPECT_TRUE(HidValues("gauge").empty()) << "no drive-gone command";
+  EXPECT_TRUE(machine_.Attached("gauge"));
+}
+
+TEST_F(SafeRemovalTest, RemovalActsOnTheChannelsOwnDriveAfterTheListChanged) {
+  // The first drive goes and the list is read again; the channels still
+  // carry their old indices, so the plain drive's index now names another.
+  ChannelRecord* plain = Plain();
+  machine_.Detach("gauge");
+  EnumerateDrives(nullptr);
+  AssignVolumeLetters();
+  DriveRecord stale = CopyOf(plain);
+  ASSERT_FALSE(WideEqual(stale.diskPath, plain->diskPath));
+  ASSERT_EQ(SafeRemoveDrive(&stale, plain), 1);
+  EXPECT_FALSE(machine_.Attached("plain"));
+  EXPECT_EQ(machine_.DismountCount('F'), 1);
+  for (const char* other : {"firewire", "lights", "enclosure"}) {
+    EXPECT_TRUE(machine_.Attached(other)) << other;
+  }
+  EXPECT_EQ(machine_.DismountCount('H'), 0);
+  ASSERT_EQ(machine_.Ejects().size(), 1u);
+  EXPECT_EQ(machine_.Ejects()[0].drive, "plain");
+}
+
+TEST_F(SafeRemovalTest, OnlyAMissingMediumCountsAsNothingToDismount) {
+  // Any other failure of the medium check (a spun-down drive, a changed
+  // medium, a device error) may leave the volume mounted.
+  ChannelRecord* plain = Plain();
+  const LONG linked = plain->linkedDrive;
+  for (DWORD error : {DWORD{1110}, DWORD{1117}, DWORD{ERROR_GEN_FAILURE}}) {
+    machine_.SetMediumCheckError('F', error);
+    EXPECT_EQ(Remove(plain), 0) << error;
+    ExpectNotRemoved("plain", plain, linked);
+    EXPECT_EQ(monitorState.driveListStale, 0u);
+  }
+  EXPECT_TRUE(machine_.Ejects().empty());
+  const struct {
+    const char* drive;
+    char letter;
+    DWORD error;
+  } noMedium[] = {{"plain", 'F', ERROR_NOT_READY}, {"firewire", 'H', 1112}};
+  for (const auto& c : noMedium) {
+    machine_.SetMediumCheckError(c.letter, c.error);
+    monitorState.driveListStale = 0;
+    EXPECT_EQ(Remove(Channel(c.drive == std::string("plain") ? "pid_2a31" : "external_hdd#")), 1);
+    EXPECT_FALSE(machine_.Attached(c.drive));
+    EXPECT_EQ(machine_.DismountCount(c.letter), 0);
+    EXPECT_EQ(monitorState.driveListStale, 1u);
+  }
 }
 
 TEST_F(SafeRemovalTest, HeldVolumeStopsTheRemovalBeforeAnyEject) {
@@ -75,6 +139,28 @@ TEST_F(SafeRemovalTest, HeldVolumeStopsTheRemovalBeforeAnyEject) {
   EXPECT_TRUE(machine_.Ejects().empty());
   ExpectNotRemoved("gauge", gauge, linked);
   EXPECT_TRUE(HidValues("gauge").empty());
+
+  // A failed lock or dismount fails the removal the same way.
+  for (DWORD code : {FSCTL_LOCK_VOLUME, FSCTL_DISMOUNT_VOLUME}) {
+    machine_.SetVolumeHeldOpen('K', false);
+    machine_.SetVolumeControlError('E', code, ERROR_ACCESS_DENIED);
+    EXPECT_EQ(Remove(gauge), 0) << code;
+    EXPECT_TRUE(machine_.Ejects().empty());
+    machine_.SetVolumeControlError('E', code, 0);
+  }
+
+  // A USB drive of an enclosure-mode channel loses the channel's handle
+  // before its volumes are touched, and gets it back when they stay online.
+  DriveRecord copy = CopyOf(gauge);
+  copy.channelMode = kChannelModeEnclosure;
+  machine_.SetVolumeHeldOpen('K', true);
+  EXPECT_EQ(SafeRemoveDrive(&copy, gauge), 0);
+  ASSERT_NE(gauge->deviceHandle, nullptr);
+  EXPECT_EQ(machine_.OpenCount("gauge", sim::Endpoint::Hid), 1u);
+  machine_.SetVolumeHeldOpen('K', false);
+  ASSERT_EQ(SafeRemoveDrive(&copy, gauge), 1);
+  EXPECT_EQ(gauge->deviceHandle, nullptr);
+  EXPECT_EQ(machine_.OpenCount("gauge", sim::Endpoint::Hid), 0u);
 }
 
 TEST_F(SafeRemovalTest, VetoIsRetriedFourTimes) {

@@ -6,6 +6,7 @@
 
 #include <gtest/gtest.h>
 
+#include <cstring>
 #include <thread>
 #include <vector>
 
@@ -13,6 +14,7 @@
 #include "machine.h"
 #include "service/process_locks.h"
 #include "support/test_support.h"
+#include "transport/io_block.h"
 
 namespace {
 
@@ -122,6 +124,31 @@ TEST_F(PassThroughTest, DeviceErrorsBecomeTheResult) {
             kIoError);
 }
 
+TEST_F(PassThroughTest, RejectedCommandsFailAndShortRepliesAreZeroFilled) {
+  // CHECK CONDITION (status 2) for pages the drive does not have.
+  constexpr DWORD kCheckCondition = kScsiStatusErrorBase | 0x02;
+  BYTE page[20];
+  std::memset(page, 0xAA, sizeof(page));
+  EXPECT_EQ(ScsiInquiryPage(disk_.Get(), 0x83, page, sizeof(page), abort_.Get()), kCheckCondition);
+  EXPECT_EQ(GetLastError(), kCheckCondition);
+  OVERLAPPED overlapped{};
+  overlapped.hEvent = ownEvent_.Get();
+  EXPECT_EQ(ReceiveDiagnosticPage(disk_.Get(), 0x85, page, 8, &overlapped, abort_.Get()),
+            kCheckCondition);
+  const BYTE unknown[5] = {0x84, 0x00, 0x00, 0x01, 0x00};
+  overlapped = OVERLAPPED{};
+  overlapped.hEvent = ownEvent_.Get();
+  EXPECT_EQ(SendDiagnosticPage(disk_.Get(), unknown, sizeof(unknown), &overlapped, nullptr),
+            kCheckCondition);
+
+  // Page 0x00 of six pages is 10 bytes: the rest of the 20 asked for is zero.
+  std::memset(page, 0xAA, sizeof(page));
+  ASSERT_EQ(ScsiInquiryPage(disk_.Get(), 0x00, page, sizeof(page), abort_.Get()), 0u);
+  EXPECT_EQ(page[3], 6);
+  EXPECT_EQ(page[9], 0xC1);
+  for (std::size_t i = 10; i < sizeof(page); ++i) EXPECT_EQ(page[i], 0) << i;
+}
+
 TEST_F(PassThroughTest, SynchronousHandleWithoutEventCompletesInline) {
   skytest::Handle syncDisk(OpenDisk(0));
   ASSERT_TRUE(syncDisk.Valid());
@@ -218,25 +245,40 @@ TEST_F(PassThroughTest, AbortEndsAPendingTransfer) {
   EXPECT_EQ(ScsiInquiry(disk, inquiry, abortEvent), 0u);
 }
 
-TEST_F(PassThroughTest, SlowCancellationIsWaitedOutBeforeReturning) {
-  // The cancellation takes longer than the 3000 ms grace; the operation must
-  // not return (and free its request) while the drive may still write.
-  machine_.SetCancelDelay(kDrive, sim::Endpoint::Disk, 2 * kCancelGraceMs);
+TEST_F(PassThroughTest, ACancelThatNeverEndsHoldsTheCallerOnlyForTheGrace) {
+  // The drive never completes a cancelled request until told: each call
+  // returns after the grace, its request set aside, and the late reply goes
+  // into the set-aside block, never into the caller's buffers.
+  machine_.SetCancelDelay(kDrive, sim::Endpoint::Disk, INFINITE);
   machine_.HangIo(kDrive, sim::Endpoint::Disk, true);
   SetEvent(abort_.Get());
+  const std::size_t asideBefore = SetAsideIoBlockCount();
 
   BYTE inquiry[kInquiryLength] = {};
   EXPECT_EQ(ScsiInquiry(disk_.Get(), inquiry, abort_.Get()), DWORD{ERROR_OPERATION_ABORTED});
-  EXPECT_EQ(machine_.PendingCount(kDrive, sim::Endpoint::Disk), 0u);
-
+  EXPECT_EQ(SetAsideIoBlockCount(), asideBefore + 1);
   OVERLAPPED overlapped{};
   overlapped.hEvent = ownEvent_.Get();
   const BYTE page[5] = {0x81, 0x00, 0x00, 0x01, 0x05};
   EXPECT_EQ(SendDiagnosticPage(disk_.Get(), page, sizeof(page), &overlapped, abort_.Get()),
             DWORD{ERROR_IO_PENDING});
   EXPECT_EQ(GetLastError(), DWORD{ERROR_OPERATION_ABORTED});
-  EXPECT_TRUE(HasOverlappedIoCompleted(&overlapped));
-  EXPECT_EQ(machine_.PendingCount(kDrive, sim::Endpoint::Disk), 0u);
+  EXPECT_EQ(SetAsideIoBlockCount(), asideBefore + 2);
+  STORAGE_DEVICE_NUMBER number{};
+  DWORD bytes = 9;
+  EXPECT_FALSE(IoControlWait(disk_.Get(), IOCTL_STORAGE_GET_DEVICE_NUMBER, nullptr, 0, &number,
+                             sizeof(number), &bytes, abort_.Get()));
+  EXPECT_EQ(bytes, 0u);
+  EXPECT_EQ(SetAsideIoBlockCount(), asideBefore + 3);
+
+  machine_.FinishHeldCancels();
+  EXPECT_EQ(inquiry[8], 0) << "the late reply reached the set-aside block only";
+  EXPECT_EQ(number.DeviceNumber, 0u);
+  machine_.HangIo(kDrive, sim::Endpoint::Disk, false);
+  ResetEvent(abort_.Get());
+  EXPECT_EQ(SetAsideIoBlockCount(), asideBefore) << "freed once seen complete";
+  EXPECT_EQ(ScsiInquiry(disk_.Get(), inquiry, abort_.Get()), 0u);
+  FreeSetAsideIoBlocks();
 }
 
 }  // namespace

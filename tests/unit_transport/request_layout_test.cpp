@@ -18,6 +18,7 @@ struct Captured {
   DWORD inputLength = 0;
   DWORD outputLength = 0;
   bool sameBuffer = false;
+  const void* input = nullptr;
   PassThroughRequest request{};
 };
 
@@ -31,6 +32,7 @@ class RecordingDevice : public emu::DeviceFile {
     captured.inputLength = inputLength;
     captured.outputLength = outputLength;
     captured.sameBuffer = input == output;
+    captured.input = input;
     if (input != nullptr && inputLength >= sizeof(PassThroughRequest)) {
       std::memcpy(&captured.request, input, sizeof(PassThroughRequest));
     }
@@ -91,7 +93,10 @@ class RequestLayoutTest : public ::testing::Test {
     EXPECT_EQ(spt.DataTransferLength, dataLength);
     EXPECT_EQ(spt.TimeOutValue, 20u);
     if (data != nullptr) {
-      EXPECT_EQ(spt.DataBuffer, data);
+      // The device reads and writes a copy of the data right behind the
+      // request, in the request's own block, never the caller's buffer.
+      EXPECT_EQ(spt.DataBuffer, static_cast<const BYTE*>(captured.input) + 80);
+      EXPECT_NE(spt.DataBuffer, data);
     }
     EXPECT_EQ(spt.SenseInfoOffset, 60u);
     cdb.resize(16, 0);
