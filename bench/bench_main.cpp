@@ -1,5 +1,7 @@
-// skyvane_bench [--quick] [--json FILE]: measures the figures and prints
-// them as a table, and as JSON to FILE when asked.
+// skyvane_bench [--quick] [--json FILE] [--service PATH]: measures the
+// figures and prints them as a table, and as JSON to FILE when asked. With
+// --service it starts that executable in the foreground and measures it too;
+// it must be the only service of its emulation namespace (or of the machine).
 #include <cstdio>
 #include <cstring>
 #include <string>
@@ -44,17 +46,21 @@ int main(int argc, char** argv) {
       options.quick = true;
     } else if (std::strcmp(argv[i], "--json") == 0 && i + 1 < argc) {
       json = argv[++i];
+    } else if (std::strcmp(argv[i], "--service") == 0 && i + 1 < argc) {
+      options.service = argv[++i];
     } else {
-      std::fprintf(stderr, "usage: skyvane_bench [--quick] [--json FILE]\n");
+      std::fprintf(stderr, "usage: skyvane_bench [--quick] [--json FILE] [--service PATH]\n");
       return 2;
     }
   }
   std::vector<bench::Figure> figures;
+  const double floor = bench::MeasureFloor(options, figures);
   bench::MeasureWakeLatency(options, figures);
+  bool ok = options.service.empty() || bench::MeasureService(options, floor, figures);
   PrintTable(figures);
   if (json != nullptr && !WriteJson(json, figures)) {
     std::fprintf(stderr, "cannot write %s\n", json);
     return 1;
   }
-  return 0;
+  return ok ? 0 : 1;
 }

@@ -20,6 +20,7 @@ struct Figure {
 
 struct Options {
   bool quick = false;  // CI's short mode: few iterations, only proving it works
+  std::string service;  // the service executable; empty: no service figures
 };
 
 inline double NowMicros() {
@@ -38,5 +39,17 @@ inline double Percentile(std::vector<double>& samples, double p) {
 // The kernel's wake-up latency: one event signalled while 64 other threads
 // wait on other events; the time until its waiter runs, p50 and p99.
 void MeasureWakeLatency(const Options& options, std::vector<Figure>& figures);
+
+// The floor: a message-mode pipe echo of 9,896 bytes plus one copy of the
+// 1,215,512-byte block, in this process. Returns its p50 in microseconds.
+double MeasureFloor(const Options& options, std::vector<Figure>& figures);
+
+// Command 10 and command 13 round trips against the running service, as
+// ratios to `floor`. False when the service did not answer.
+bool MeasureCommands(const Options& options, double floor, std::vector<Figure>& figures);
+
+// Starts the service, waits for it to be ready, takes the command figures,
+// its idle CPU and its resident memory, and stops it. False on failure.
+bool MeasureService(const Options& options, double floor, std::vector<Figure>& figures);
 
 }  // namespace bench
