@@ -1,0 +1,180 @@
+#include "drive_fuzz_entry.h"
+
+#include <algorithm>
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+#include <set>
+#include <string>
+
+#include "discovery/channel_binding.h"
+#include "discovery/channel_scan.h"
+#include "discovery/drive_enumeration.h"
+#include "fuzz_support.h"
+#include "monitor/monitor_state.h"
+#include "pipe/command_message.h"
+#include "pipe/dispatcher.h"
+#include "pipe/pipe_instance.h"
+#include "service/process_locks.h"
+#include "transport/button_events.h"
+#include "volume/volume_letters.h"
+
+namespace {
+
+using fuzzsupport::Check;
+
+constexpr std::uint32_t kDriveCommands[] = {kCommandSafeRemove,       kCommandReleaseDrive,
+                                            kCommandReleaseDriveAlso, kCommandRefreshGauges,
+                                            kCommandReadStatus,       kCommandWriteControl};
+
+fuzzsupport::RecordingModel* computer = nullptr;
+StateBlock* block = nullptr;
+StateBlock* snapshot = nullptr;
+HANDLE channelHandles[kMaxChannels] = {};
+std::size_t ejectsSeen = 0;
+// Every path the service found itself: only these may ever be opened.
+std::set<std::u16string> servicePaths;
+
+void AddPath(const WCHAR* path) {
+  if (path[0] != 0) servicePaths.insert(std::u16string(path));
+}
+
+// What a rescan and the workers' linking build, without worker threads: the
+// drives, their letters, the channel records with the shared handles open,
+// each channel linked, and the published list.
+void Scan() {
+  for (int i = 0; i < kMaxChannels; ++i) {
+    if (channelHandles[i] != nullptr && block->channels[i].deviceHandle == channelHandles[i]) {
+      CloseHandle(channelHandles[i]);
+    }
+    channelHandles[i] = nullptr;
+  }
+  std::memset(static_cast<void*>(block), 0, sizeof(StateBlock));
+  EnumerateDrives(nullptr);
+  AssignVolumeLetters();
+  RebuildChannelTable();
+  for (int i = 0; i < block->channelCount && i < kMaxChannels; ++i) {
+    ChannelRecord& channel = block->channels[i];
+    const bool readWrite = channel.kind == kChannelKindHid || channel.mode != 0;
+    channel.deviceHandle =
+        CreateFileW(channel.devicePath, readWrite ? GENERIC_READ | GENERIC_WRITE : 0,
+                    readWrite ? FILE_SHARE_READ | FILE_SHARE_WRITE : 0, nullptr, OPEN_EXISTING,
+                    FILE_FLAG_OVERLAPPED, nullptr);
+    Check(channel.deviceHandle != INVALID_HANDLE_VALUE, "channel opens");
+    channelHandles[i] = channel.deviceHandle;
+    ReadDriveIdentity(&channel, nullptr, 0);
+    DriveRecord scratch{};
+    BindChannelToDrive(&channel, &scratch, 0);
+  }
+  BuildPublishedList(block);
+  int linked = 0;
+  for (int i = 0; i < block->channelCount; ++i) linked += block->channels[i].linkedDrive >= 0;
+  Check(block->driveCount > 0 && linked == block->channelCount, "every channel is linked");
+
+  for (const std::u16string& path : computer->TakeOpened()) servicePaths.insert(path);
+  for (int i = 0; i < block->driveCount; ++i) {
+    const DriveRecord& drive = block->drives[i];
+    for (const WCHAR* path : {drive.diskPath, drive.channelPath, drive.controlPath, drive.hidPath})
+      AddPath(path);
+    for (const WCHAR* letter = drive.volumeLetters; *letter != 0; ++letter) {
+      servicePaths.insert(u"\\\\.\\" + std::u16string(1, *letter) + u":");
+    }
+  }
+  for (int i = 0; i < block->channelCount; ++i) {
+    const ChannelRecord& channel = block->channels[i];
+    for (const WCHAR* path : {channel.diskPath, channel.devicePath, channel.controlPath})
+      AddPath(path);
+  }
+  std::memcpy(static_cast<void*>(snapshot), block, sizeof(StateBlock));
+  ejectsSeen = computer->Inner().Ejects().size();
+}
+
+void SetUpOnce() {
+  static bool done = false;
+  if (done) return;
+  done = true;
+  fuzzsupport::UsePrivateEmulation("drivefuzz");
+  std::string error;
+  std::unique_ptr<sim::Machine> machine = sim::LoadMachine(sim::DefaultMachineText(), &error);
+  Check(machine != nullptr, "the default machine loads");
+  machine->SetDeviceEventSink([](DWORD, const void*) {});
+  computer = new fuzzsupport::RecordingModel(std::move(machine));
+  emu::SetDeviceModel(computer);
+  InitializeProcessLocks();
+  block = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));
+  snapshot = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));
+  monitorState = MonitorState{};
+  monitorState.tick = 1;
+  monitorState.osKind = kOsXpOrLater;
+  monitorState.stateBlock = block;
+  monitorState.stateMutex = CreateMutexW(nullptr, FALSE, nullptr);
+  monitorState.fileMapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0,
+                                                kStateBlockSize, nullptr);
+  monitorState.pipeStopEvent = CreateEventW(nullptr, FALSE, FALSE, nullptr);
+  monitorState.stopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+  monitorState.workerStopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+  Check(block != nullptr && snapshot != nullptr && monitorState.stateMutex != nullptr &&
+            monitorState.fileMapping != nullptr && monitorState.pipeStopEvent != nullptr,
+        "set-up");
+  Scan();
+}
+
+// Puts the computer and the block back as the set-up left them: a removed
+// drive comes back, and a closed channel handle makes the channels be opened
+// again.
+void Restore() {
+  const std::vector<sim::Machine::EjectRequest> ejects = computer->Inner().Ejects();
+  bool rescan = ejects.size() != ejectsSeen;
+  for (std::size_t i = ejectsSeen; i < ejects.size(); ++i) {
+    if (!computer->Inner().Attached(ejects[i].drive)) computer->Inner().Attach(ejects[i].drive);
+  }
+  for (int i = 0; i < kMaxChannels && !rescan; ++i) {
+    rescan = block->channels[i].deviceHandle != channelHandles[i];
+  }
+  computer->Inner().ClearCommands();
+  if (rescan) {
+    computer->Inner().WaitForDeviceEvents();
+    Scan();
+  } else {
+    std::memcpy(static_cast<void*>(block), snapshot, sizeof(StateBlock));
+  }
+  monitorState.paused = 0;
+  monitorState.pauseTicks = 0;
+  monitorState.skipTicks = 0;
+}
+
+}  // namespace
+
+int DriveFuzzOneInput(const std::uint8_t* data, std::size_t size) {
+  SetUpOnce();
+  if (size == 0) return 0;
+  const std::uint8_t selector = data[0];
+  const std::size_t received = std::min<std::size_t>(size - 1, kPipeReadSize);
+  // The message as it arrives, in a buffer of exactly its size: the selected
+  // command, and the key of one of the service's drives when asked for.
+  std::unique_ptr<BYTE[]> message(new BYTE[received == 0 ? 1 : received]);
+  std::memcpy(message.get(), data + 1, received);
+  const std::uint32_t command = kDriveCommands[(selector & 7) % std::size(kDriveCommands)];
+  if (received >= offsetof(CommandMessage, arg1)) {
+    std::memcpy(message.get() + offsetof(CommandMessage, command), &command, sizeof(command));
+  }
+  const int drive = selector >> 4;
+  const std::size_t key = offsetof(CommandMessage, driveImage) + kDriveKeyOffsetInImage;
+  if (drive < block->driveCount && received >= key + kDriveKeyCapacity * sizeof(WCHAR)) {
+    std::memcpy(message.get() + key, block->drives[drive].firmwareSerial,
+                kDriveKeyCapacity * sizeof(WCHAR));
+  }
+  const bool paused = (selector & 8) != 0;
+  monitorState.paused = paused ? 1 : 0;
+
+  static std::unique_ptr<BYTE[]> request(new BYTE[kPipeBufferBytes]);
+  static std::unique_ptr<BYTE[]> reply(new BYTE[kPipeBufferBytes]);
+  std::memcpy(request.get(), message.get(), received);
+  const DWORD length = DispatchRequest(request.get(), static_cast<DWORD>(received), reply.get());
+  fuzzsupport::CheckReply(message.get(), received, reply.get(), length, paused, false);
+  for (const std::u16string& path : computer->TakeOpened()) {
+    Check(servicePaths.count(path) != 0, "a path the service did not find was opened");
+  }
+  Restore();
+  return 0;
+}
