@@ -88,12 +88,14 @@ void Check(bool condition, const char* what) {
 
 void UsePrivateEmulation(const char* tag) {
   const std::string stem = std::string(tag) + "-" + std::to_string(getpid());
-  setenv("SKYVANE_NAMESPACE", stem.c_str(), 1);
-  privateRegistry = std::filesystem::temp_directory_path() / stem;
-  std::filesystem::create_directories(privateRegistry);
-  setenv("SKYVANE_REGISTRY", (privateRegistry / "registry").c_str(), 1);
+  setenv("SKYVANE_NAMESPACE", stem.c_str(), 0);
+  if (std::getenv("SKYVANE_REGISTRY") == nullptr) {
+    privateRegistry = std::filesystem::temp_directory_path() / stem;
+    std::filesystem::create_directories(privateRegistry);
+    setenv("SKYVANE_REGISTRY", (privateRegistry / "registry").c_str(), 1);
+    std::atexit(RemovePrivateRegistry);
+  }
   setenv("SKYVANE_TIME_SCALE", "0.001", 0);
-  std::atexit(RemovePrivateRegistry);
 }
 
 std::vector<std::u16string> RecordingModel::TakeOpened() {

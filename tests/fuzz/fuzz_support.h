@@ -19,7 +19,8 @@ namespace fuzzsupport {
 void Check(bool condition, const char* what);
 
 // Gives this process an emulated namespace, registry store and time scale of
-// its own, so that random requests land nowhere else and waits are short.
+// its own (unless the environment names them), so that random requests land
+// nowhere else and waits are short.
 void UsePrivateEmulation(const char* tag);
 
 // A computer that answers as `inner` does and records every path opened.
