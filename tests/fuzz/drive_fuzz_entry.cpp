@@ -6,6 +6,8 @@
 #include <memory>
 #include <set>
 #include <string>
+#include <string_view>
+#include <vector>
 
 #include "discovery/channel_binding.h"
 #include "discovery/channel_scan.h"
@@ -31,7 +33,7 @@ fuzzsupport::RecordingModel* computer = nullptr;
 StateBlock* block = nullptr;
 StateBlock* snapshot = nullptr;
 HANDLE channelHandles[kMaxChannels] = {};
-std::size_t ejectsSeen = 0;
+std::vector<std::string> driveNames;
 // Every path the service found itself: only these may ever be opened.
 std::set<std::u16string> servicePaths;
 
@@ -70,6 +72,7 @@ void Scan() {
   int linked = 0;
   for (int i = 0; i < block->channelCount; ++i) linked += block->channels[i].linkedDrive >= 0;
   Check(block->driveCount > 0 && linked == block->channelCount, "every channel is linked");
+  Check(static_cast<std::size_t>(block->driveCount) >= driveNames.size(), "every drive is found");
 
   for (const std::u16string& path : computer->TakeOpened()) servicePaths.insert(path);
   for (int i = 0; i < block->driveCount; ++i) {
@@ -86,7 +89,18 @@ void Scan() {
       AddPath(path);
   }
   std::memcpy(static_cast<void*>(snapshot), block, sizeof(StateBlock));
-  ejectsSeen = computer->Inner().Ejects().size();
+}
+
+// The names of the drives the machine description declares ("drive NAME").
+std::vector<std::string> DriveNames(std::string_view text) {
+  std::vector<std::string> names;
+  while (!text.empty()) {
+    const std::size_t end = std::min(text.find('\n'), text.size());
+    const std::string_view line = text.substr(0, end);
+    if (line.substr(0, 6) == "drive ") names.emplace_back(line.substr(6));
+    text.remove_prefix(std::min(end + 1, text.size()));
+  }
+  return names;
 }
 
 void SetUpOnce() {
@@ -98,6 +112,8 @@ void SetUpOnce() {
   std::unique_ptr<sim::Machine> machine = sim::LoadMachine(sim::DefaultMachineText(), &error);
   Check(machine != nullptr, "the default machine loads");
   machine->SetDeviceEventSink([](DWORD, const void*) {});
+  driveNames = DriveNames(sim::DefaultMachineText());
+  Check(!driveNames.empty(), "the default machine names its drives");
   computer = new fuzzsupport::RecordingModel(std::move(machine));
   emu::SetDeviceModel(computer);
   InitializeProcessLocks();
@@ -123,10 +139,11 @@ void SetUpOnce() {
 // drive comes back, and a closed channel handle makes the channels be opened
 // again.
 void Restore() {
-  const std::vector<sim::Machine::EjectRequest> ejects = computer->Inner().Ejects();
-  bool rescan = ejects.size() != ejectsSeen;
-  for (std::size_t i = ejectsSeen; i < ejects.size(); ++i) {
-    if (!computer->Inner().Attached(ejects[i].drive)) computer->Inner().Attach(ejects[i].drive);
+  bool rescan = false;
+  for (const std::string& name : driveNames) {
+    if (computer->Inner().Attached(name)) continue;
+    computer->Inner().Attach(name);
+    rescan = true;
   }
   for (int i = 0; i < kMaxChannels && !rescan; ++i) {
     rescan = block->channels[i].deviceHandle != channelHandles[i];
