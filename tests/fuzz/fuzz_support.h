@@ -23,6 +23,11 @@ void Check(bool condition, const char* what);
 // nowhere else and waits are short.
 void UsePrivateEmulation(const char* tag);
 
+// Removes the emulated registry store once random requests have made it
+// large: every registry call reads the whole store, so a growing store would
+// slow each execution down.
+void KeepRegistrySmall();
+
 // A computer that answers as `inner` does and records every path opened.
 class RecordingModel : public emu::DeviceModel {
  public:

@@ -75,5 +75,6 @@ int PipeFuzzOneInput(const std::uint8_t* data, std::size_t size) {
   } else {
     FuzzRegistry(data + 1, size - 1);
   }
+  fuzzsupport::KeepRegistrySmall();
   return 0;
 }
