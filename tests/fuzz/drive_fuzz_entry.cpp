@@ -41,20 +41,18 @@ void AddPath(const WCHAR* path) {
   if (path[0] != 0) servicePaths.insert(std::u16string(path));
 }
 
-// What a rescan and the workers' linking build, without worker threads: the
-// drives, their letters, the channel records with the shared handles open,
-// each channel linked, and the published list.
-void Scan() {
+// Closes the channels' shared handles that the service has not closed itself.
+void CloseChannels() {
   for (int i = 0; i < kMaxChannels; ++i) {
     if (channelHandles[i] != nullptr && block->channels[i].deviceHandle == channelHandles[i]) {
       CloseHandle(channelHandles[i]);
     }
     channelHandles[i] = nullptr;
   }
-  std::memset(static_cast<void*>(block), 0, sizeof(StateBlock));
-  EnumerateDrives(nullptr);
-  AssignVolumeLetters();
-  RebuildChannelTable();
+}
+
+// Opens each channel's shared handle as the worker starter does.
+void OpenChannels() {
   for (int i = 0; i < block->channelCount && i < kMaxChannels; ++i) {
     ChannelRecord& channel = block->channels[i];
     const bool readWrite = channel.kind == kChannelKindHid || channel.mode != 0;
@@ -64,6 +62,21 @@ void Scan() {
                     FILE_FLAG_OVERLAPPED, nullptr);
     Check(channel.deviceHandle != INVALID_HANDLE_VALUE, "channel opens");
     channelHandles[i] = channel.deviceHandle;
+  }
+}
+
+// What a rescan and the workers' linking build, without worker threads: the
+// drives, their letters, the channel records with the shared handles open,
+// each channel linked, and the published list.
+void Scan() {
+  CloseChannels();
+  std::memset(static_cast<void*>(block), 0, sizeof(StateBlock));
+  EnumerateDrives(nullptr);
+  AssignVolumeLetters();
+  RebuildChannelTable();
+  OpenChannels();
+  for (int i = 0; i < block->channelCount && i < kMaxChannels; ++i) {
+    ChannelRecord& channel = block->channels[i];
     ReadDriveIdentity(&channel, nullptr, 0);
     DriveRecord scratch{};
     BindChannelToDrive(&channel, &scratch, 0);
@@ -124,37 +137,44 @@ void SetUpOnce() {
   monitorState.osKind = kOsXpOrLater;
   monitorState.stateBlock = block;
   monitorState.stateMutex = CreateMutexW(nullptr, FALSE, nullptr);
-  monitorState.fileMapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0,
-                                                kStateBlockSize, nullptr);
+  // No mapping: a publish then fails to map a view and copies nothing. The
+  // pipe target covers publishing; here a 1.2 MB copy per input would take
+  // most of the time.
+  monitorState.fileMapping = nullptr;
   monitorState.pipeStopEvent = CreateEventW(nullptr, FALSE, FALSE, nullptr);
   monitorState.stopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
   monitorState.workerStopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
   Check(block != nullptr && snapshot != nullptr && monitorState.stateMutex != nullptr &&
-            monitorState.fileMapping != nullptr && monitorState.pipeStopEvent != nullptr,
+            monitorState.pipeStopEvent != nullptr,
         "set-up");
   Scan();
 }
 
-// Puts the computer and the block back as the set-up left them: a removed
-// drive comes back, and a closed channel handle makes the channels be opened
-// again.
+// Puts the computer and the block back as the set-up left them. A removed
+// drive comes back with the same paths, and a closed channel handle is opened
+// again; the records of the set-up still describe the computer, so they are
+// restored rather than rebuilt.
 void Restore() {
-  bool rescan = false;
+  bool reopen = false;
   for (const std::string& name : driveNames) {
     if (computer->Inner().Attached(name)) continue;
     computer->Inner().Attach(name);
-    rescan = true;
+    reopen = true;
   }
-  for (int i = 0; i < kMaxChannels && !rescan; ++i) {
-    rescan = block->channels[i].deviceHandle != channelHandles[i];
+  for (int i = 0; i < kMaxChannels && !reopen; ++i) {
+    reopen = block->channels[i].deviceHandle != channelHandles[i];
   }
-  computer->Inner().ClearCommands();
-  if (rescan) {
+  if (reopen) {
     computer->Inner().WaitForDeviceEvents();
-    Scan();
+    CloseChannels();
+    std::memcpy(static_cast<void*>(block), snapshot, sizeof(StateBlock));
+    OpenChannels();
+    for (int i = 0; i < kMaxChannels; ++i) snapshot->channels[i].deviceHandle = channelHandles[i];
   } else {
     std::memcpy(static_cast<void*>(block), snapshot, sizeof(StateBlock));
   }
+  computer->Inner().ClearCommands();
+  computer->TakeOpened();
   monitorState.paused = 0;
   monitorState.pauseTicks = 0;
   monitorState.skipTicks = 0;
