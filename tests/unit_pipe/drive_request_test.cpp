@@ -31,10 +31,10 @@ class DriveRequestTest : public pipetest::MonitorFixture {
     if (HasFatalFailure()) return;
     InitializeProcessLocks();
     monitorState.osKind = kOsXpOrLater;
-    sim::DriveSpec spec;
-    spec.name = "usb";
-    spec.volumes = {sim::VolumeSpec{'E'}};
-    machine_.AddDrive(spec);
+    sim::DriveSpec drive;
+    drive.name = "usb";
+    drive.volumes = {sim::VolumeSpec{'E'}};
+    machine_.AddDrive(drive);
     machine_.Install();
     EnumerateDrives(nullptr);
     AssignVolumeLetters();
