@@ -46,6 +46,11 @@ bool LockOrStop() {
   const DWORD count = list[0] != nullptr ? 2 : 1;
   const DWORD wait = WaitForMultipleObjects(count, list + (2 - count), FALSE, INFINITE);
   const DWORD mutexSlot = count - 1;
+  if (count == 2 && wait == WAIT_OBJECT_0) {
+    // The server's own wait must still see the stop, whatever the event's kind.
+    SetEvent(list[0]);
+    return false;
+  }
   return wait == WAIT_OBJECT_0 + mutexSlot || wait == WAIT_ABANDONED_0 + mutexSlot;
 }
 

@@ -231,6 +231,22 @@ TEST_F(PipeServerTest, StopEventEndsTheThreadWithClientsConnected) {
   if (after != INVALID_HANDLE_VALUE) CloseHandle(after);
 }
 
+TEST_F(PipeServerTest, StopEndsTheThreadWhileSomeoneElseHoldsTheMutex) {
+  // Any account may open the mutex and keep it; a request then waits for it.
+  Handle client = Connect();
+  ASSERT_TRUE(client);
+  ASSERT_EQ(WaitForSingleObject(monitorState.stateMutex, skytest::kGuardMs), WAIT_OBJECT_0);
+  auto request = NewCommand(kCommandSetStatus, 9);
+  DWORD written = 0;
+  ASSERT_TRUE(WriteFile(client.Get(), request.get(), sizeof(CommandMessage), &written, nullptr));
+  // Lets the server reach its wait for the mutex; the outcome does not depend
+  // on it, only whether the case meets that wait.
+  Sleep(50);
+  EXPECT_TRUE(StopServer());
+  ReleaseMutex(monitorState.stateMutex);
+  EXPECT_NE(Published()->statusWord, 9u) << "the request ran after the stop";
+}
+
 class PipeNameTakenTest : public pipetest::MonitorFixture {};
 
 TEST_F(PipeNameTakenTest, ServerLogsAHeldNameAndServesOnceItIsFree) {
