@@ -62,6 +62,15 @@ bool WaitForReadyEvents(HANDLE* events, DWORD count) {
 
 void RescanDrives() {
   RescanGuard guard;
+  bool running;
+  {
+    StateLock lock;
+    running = workerState.workerCount != 0;
+  }
+  // The channel table is rebuilt below: workers that a rescan on another
+  // thread started meanwhile (a forwarded resume before the start-up rescan)
+  // are stopped first.
+  if (running) QuiesceChannels();
   HANDLE readyEvents[kMaxChannels];
   DWORD readyCount = 0;
   {

@@ -463,6 +463,20 @@ TEST_F(MonitorLoop, WorkerRestartWaitsForAQuiesceOnAnotherThread) {
   // Handles and threads of every worker are gone: checked by the leak check.
 }
 
+TEST_F(MonitorLoop, RescanWhileWorkersRunStopsThemFirst) {
+  // A forwarded resume may start workers before the start-up rescan runs.
+  InstallDefaultMachine();
+  Start([](const std::vector<Pass>&) {});
+  ASSERT_TRUE(WaitUntil([] {
+    StateLock lock;
+    return monitorState.rescanCount >= 1 && workerState.workerCount > 0;
+  }));
+  RescanDrives();
+  StopMonitor();
+  Finish();
+  // Every channel handle of the first workers was closed: the leak check.
+}
+
 TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
   InstallDefaultMachine();
   // The firewire drive answers a status that keeps it out of the published
