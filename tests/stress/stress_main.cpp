@@ -223,10 +223,10 @@ void RunCycle(const Options& options, sim::Machine* machine, HANDLE mapping, std
     monitorDone = true;
   });
   chaosRunning = true;
-  std::vector<std::thread> chaos;
-  chaos.emplace_back(PipeClient, random(), mapping);
-  chaos.emplace_back(PipeClient, random(), mapping);
-  chaos.emplace_back(DeviceChaos, random(), machine, options.heldCancels);
+  std::vector<std::thread> clients;
+  clients.emplace_back(PipeClient, random(), mapping);
+  clients.emplace_back(PipeClient, random(), mapping);
+  std::thread devices(DeviceChaos, random(), machine, options.heldCancels);
   // Some stops come at once, before the monitor has even started.
   const int runMs = Pick(random, 5) == 0
                         ? 0
@@ -239,10 +239,10 @@ void RunCycle(const Options& options, sim::Machine* machine, HANDLE mapping, std
   while (!monitorDone) {
     const auto waited = Clock::now() - stopAt;
     if (!released && waited > std::chrono::milliseconds(options.stopLimitMs)) {
-      // Over the limit: let held cancels finish and see whether that ends it.
+      // Over the limit: let held cancels finish and see whether that ends it
+      // (the pipe clients may wait for a reply until then).
       chaosRunning = false;
-      for (std::thread& t : chaos) t.join();
-      chaos.clear();
+      devices.join();
       machine->ClearFaults();
       machine->FinishHeldCancels();
       released = true;
@@ -258,7 +258,8 @@ void RunCycle(const Options& options, sim::Machine* machine, HANDLE mapping, std
       std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - stopAt).count());
   monitor.join();
   chaosRunning = false;
-  for (std::thread& t : chaos) t.join();
+  if (devices.joinable()) devices.join();
+  for (std::thread& t : clients) t.join();
 
   totals->maxStopMs = std::max(totals->maxStopMs, stopMs);
   if (stopMs > options.stopLimitMs) {
