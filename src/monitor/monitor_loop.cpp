@@ -1,7 +1,9 @@
 // RunMonitor: start-up, the once-a-second loop, and the teardown.
 #include <atomic>
+#include <cstddef>
 #include <cstdlib>
 #include <cstring>
+#include <initializer_list>
 
 #include "discovery/channel_scan.h"
 #include "monitor/channel_workers.h"
@@ -51,12 +53,23 @@ void StoreStopSignal(HANDLE* field, HANDLE event) {
   if (event != nullptr && monitorStopRequested) SetEvent(event);
 }
 
+// Everything is reset; the handles from stopEvent to stateMutex, which other
+// threads read atomically, are stored atomically and left out of the copy.
 void ResetMonitorState() {
-  const HANDLE none = nullptr;
-  StoreShared(&monitorState.uiStopEvent, none);
-  StoreShared(&monitorState.pipeStopEvent, none);
-  StoreShared(&monitorState.stopEvent, none);
-  monitorState = MonitorState{};
+  static_assert(offsetof(MonitorState, stateMutex) ==
+                offsetof(MonitorState, stopEvent) + 4 * sizeof(HANDLE));
+  for (HANDLE* field :
+       {&monitorState.stopEvent, &monitorState.workerStopEvent, &monitorState.pipeStopEvent,
+        &monitorState.uiStopEvent, &monitorState.stateMutex}) {
+    StoreShared(field, nullptr);
+  }
+  const MonitorState fresh{};
+  auto* to = reinterpret_cast<unsigned char*>(&monitorState);
+  const auto* from = reinterpret_cast<const unsigned char*>(&fresh);
+  const std::size_t first = offsetof(MonitorState, stopEvent);
+  const std::size_t last = offsetof(MonitorState, stateMutex) + sizeof(HANDLE);
+  std::memcpy(to, from, first);
+  std::memcpy(to + last, from + last, sizeof(MonitorState) - last);
   monitorState.tick = 1;
   monitorState.burstCounter = 1;
   monitorState.osKind = kOsXpOrLater;
