@@ -1,7 +1,9 @@
 // RunMonitor: start-up, the once-a-second loop, and the teardown.
 #include <atomic>
+#include <cstddef>
 #include <cstdlib>
 #include <cstring>
+#include <initializer_list>
 
 #include "discovery/channel_scan.h"
 #include "monitor/channel_workers.h"
@@ -44,13 +46,30 @@ DWORD ClassifyOs() {
   return kOsXpOrLater;
 }
 
+// Stores an event that StopMonitor signals; a stop that came before the
+// event existed signals it at once.
+void StoreStopSignal(HANDLE* field, HANDLE event) {
+  StoreShared(field, event);
+  if (event != nullptr && monitorStopRequested) SetEvent(event);
+}
+
+// Everything is reset; the handles from stopEvent to stateMutex, which other
+// threads read atomically, are stored atomically and left out of the copy.
 void ResetMonitorState() {
-  monitorStopRequested = false;
-  const HANDLE none = nullptr;
-  StoreShared(&monitorState.uiStopEvent, none);
-  StoreShared(&monitorState.pipeStopEvent, none);
-  StoreShared(&monitorState.stopEvent, none);
-  monitorState = MonitorState{};
+  static_assert(offsetof(MonitorState, stateMutex) ==
+                offsetof(MonitorState, stopEvent) + 4 * sizeof(HANDLE));
+  for (HANDLE* field :
+       {&monitorState.stopEvent, &monitorState.workerStopEvent, &monitorState.pipeStopEvent,
+        &monitorState.uiStopEvent, &monitorState.stateMutex}) {
+    StoreShared(field, nullptr);
+  }
+  const MonitorState fresh{};
+  auto* to = reinterpret_cast<unsigned char*>(&monitorState);
+  const auto* from = reinterpret_cast<const unsigned char*>(&fresh);
+  const std::size_t first = offsetof(MonitorState, stopEvent);
+  const std::size_t last = offsetof(MonitorState, stateMutex) + sizeof(HANDLE);
+  std::memcpy(to, from, first);
+  std::memcpy(to + last, from + last, sizeof(MonitorState) - last);
   monitorState.tick = 1;
   monitorState.burstCounter = 1;
   monitorState.osKind = kOsXpOrLater;
@@ -106,12 +125,14 @@ void StatusPass(StateBlock* block) {
     DriveRecord& drive = block->drives[i];
     if (drive.extendedIdentity == 0) continue;
     const LONG p = drive.publishedIndex;
-    BYTE page[8];
+    BYTE page[8] = {};
     const DWORD code = ReadDriveStatus(&drive, page);
-    const LONG level = page[0] == 0x82 ? (page[4] >> 6) & 0x03 : 0;
+    const LONG level = page[0] == 0x82 ? (page[4] >> 6) & 0x03 : -1;
     drive.statusCode = code;
     drive.statusLevel = level;
-    if (p >= 0 && p < kMaxDrives) {
+    // A drive that is not published keeps index 0 from its enumeration:
+    // only the copy made from this very record is updated.
+    if (p >= 0 && p < block->publishedCount && block->published[p].recordIndex == i) {
       block->published[p].statusCode = code;
       block->published[p].statusLevel = level;
     }
@@ -123,7 +144,7 @@ void StatusPass(StateBlock* block) {
 PassKind RunPass() {
   MonitorState& m = monitorState;
   StateBlock* block = m.stateBlock;
-  PublishStateBlock(m.fileMapping, m.tick % 5 == 0);
+  PublishStateBlock(nullptr, m.tick % 5 == 0);
   WaitForSingleObject(m.stateMutex, INFINITE);
   m.passCount += 1;
   if (m.paused != 0) {
@@ -157,11 +178,8 @@ PassKind RunPass() {
   }
   if (m.workersRestartRequested != 0) {
     m.workersRestartRequested = 0;
-    if (workerState.workerCount == 0) {
-      RebuildChannelTable();
-      StartWorkers();
-    }
     ReleaseMutex(m.stateMutex);
+    RestartWorkers();
     return PassKind::WorkersRestart;
   }
   if (m.removalCheckRequested != 0) {
@@ -193,7 +211,7 @@ PassKind RunPass() {
     rescanDue = true;
   }
   ReleaseMutex(m.stateMutex);
-  PublishStateBlock(m.fileMapping, false);
+  PublishStateBlock(nullptr, false);
   if (rescanDue) QuiesceAndRescan();
   {
     StateLock lock;
@@ -205,32 +223,38 @@ PassKind RunPass() {
 }
 
 // Allocates the block and creates every object in start-up order; false at
-// the first failure (the teardown then closes what exists).
-bool StartUp(NullDaclSecurity* security) {
+// the first failure (the teardown then closes what exists). `*started` tells
+// whether the session's start succeeded.
+bool StartUp(NullDaclSecurity* security, const MonitorSession* session, bool* started) {
   MonitorState& m = monitorState;
   m.stateBlock = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));
   if (m.stateBlock == nullptr) return false;
   ReportServiceStatus(SERVICE_START_PENDING, 0, 3000);
-  StoreShared(&m.stopEvent, CreateEventW(nullptr, TRUE, FALSE, nullptr));
+  StoreStopSignal(&m.stopEvent, CreateEventW(nullptr, TRUE, FALSE, nullptr));
   if (m.stopEvent == nullptr) return false;
-  if (monitorStopRequested) SetEvent(m.stopEvent);
   m.workerStopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
   if (m.workerStopEvent == nullptr) return false;
-  ReportServiceStatus(SERVICE_RUNNING, 0, 0);
   for (ChannelRecord& channel : m.stateBlock->channels) {
     channel.readyEvent = CreateEventW(nullptr, FALSE, FALSE, nullptr);
     if (channel.readyEvent == nullptr) return false;
   }
   if (!InitNullDaclSecurity(security)) return false;
-  StoreShared(&m.uiStopEvent, CreateEventW(&security->attributes, FALSE, FALSE, kUiStopEventName));
+  StoreStopSignal(&m.uiStopEvent,
+                  CreateEventW(&security->attributes, FALSE, FALSE, kUiStopEventName));
   if (m.uiStopEvent == nullptr) return false;
-  m.stateMutex = CreateMutexW(&security->attributes, FALSE, kStateMutexName);
+  StoreShared(&m.stateMutex, CreateMutexW(&security->attributes, FALSE, kStateMutexName));
   if (m.stateMutex == nullptr) return false;
-  m.fileMapping = CreateFileMappingW(INVALID_HANDLE_VALUE, &security->attributes, PAGE_READWRITE, 0,
-                                     kStateBlockSize, kFileMapName);
+  m.fileMapping = OpenStateMapping(&security->attributes);
   if (m.fileMapping == nullptr) return false;
-  StoreShared(&m.pipeStopEvent, CreateEventW(nullptr, FALSE, FALSE, nullptr));
-  m.pipeThread = CreateThread(&security->attributes, 0, PipeServerThread, nullptr, 0, nullptr);
+  // Manual reset: it also aborts command 9's transfers, which must not
+  // consume it.
+  StoreStopSignal(&m.pipeStopEvent, CreateEventW(nullptr, TRUE, FALSE, nullptr));
+  if (m.pipeStopEvent == nullptr) return false;
+  if (session != nullptr && session->started != nullptr && !session->started()) return false;
+  *started = true;
+  ReportServiceStatus(SERVICE_RUNNING, 0, 0);
+  // Default security: no other account may open the thread.
+  m.pipeThread = CreateThread(nullptr, 0, PipeServerThread, nullptr, 0, nullptr);
   return m.pipeThread != nullptr;
 }
 
@@ -245,10 +269,11 @@ void StopPipeServer() {
   CloseIfOpen(&m.pipeStopEvent);
 }
 
-void TearDown() {
+void TearDown(const MonitorSession* session, bool started) {
   MonitorState& m = monitorState;
   // Only after a failed start-up can the pipe server still be running.
   StopPipeServer();
+  if (started && session != nullptr && session->ending != nullptr) session->ending();
   if (m.stateBlock != nullptr) {
     StopWorkers();
     for (ChannelRecord& channel : m.stateBlock->channels) {
@@ -267,23 +292,27 @@ void TearDown() {
 
 }  // namespace
 
-void RunMonitor(int, LPWSTR*) {
+void RunMonitor(int, LPWSTR*, const MonitorSession* session) {
   ResetMonitorState();
   NullDaclSecurity security;
-  if (StartUp(&security)) {
+  bool started = false;
+  if (StartUp(&security, session, &started)) {
     MonitorState& m = monitorState;
     m.osKind = ClassifyOs();
-    PublishStateBlock(m.fileMapping, true);
+    PublishStateBlock(nullptr, true);
     RescanDrives();
     while (WaitForSingleObject(m.stopEvent, 0) != WAIT_OBJECT_0) AfterPass(RunPass());
 
     ReportServiceStatus(SERVICE_STOP_PENDING, 0, 0);
+    // The pipe thread ends first, so that no command publishes after the
+    // final 500.
+    StopPipeServer();
     {
       StateLock lock;
       m.stateBlock->statusWord = kStatusStopping;
     }
-    PublishStateBlock(m.fileMapping, true);
-    StopPipeServer();
+    PublishStateBlock(nullptr, true);
   }
-  TearDown();
+  TearDown(session, started);
+  monitorStopRequested = false;
 }

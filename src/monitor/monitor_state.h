@@ -35,10 +35,11 @@ struct MonitorState {
   DWORD rescanInProgress;         // a full rescan runs
   DWORD osKind;                   // kOsWindows2000 ... kOs9x
   DWORD publishNeeded;            // the block changed since the last publish
+  DWORD mappingTooSmall;          // the named mapping cannot hold the block (logged once)
 
   HANDLE stopEvent;        // manual-reset; StopMonitor
   HANDLE workerStopEvent;  // manual-reset; stops the workers, aborts their I/O
-  HANDLE pipeStopEvent;    // auto-reset; stops the pipe server thread
+  HANDLE pipeStopEvent;    // manual-reset; stops the pipe server thread and aborts its transfers
   HANDLE uiStopEvent;      // "Global\SkyvaneUIStopEvent"
   HANDLE stateMutex;       // "Global\SkyvaneMutex"
   HANDLE fileMapping;      // "Global\SkyvaneFileMap"
@@ -69,14 +70,29 @@ struct MonitorHooks {
 extern MonitorHooks monitorHooks;
 
 // Copies the working copy into the mapping when publishNeeded is set or force
-// is true, incrementing sequence first.
+// is true, incrementing sequence first; the row references of every drive
+// record in the copy are zero. A null mapping is the service's own named
+// mapping, which is opened again while it is too small to hold the block.
 void PublishStateBlock(HANDLE mapping, bool force);
+// Creates or opens the named mapping; logs an event when an existing one is
+// too small to hold the block.
+HANDLE OpenStateMapping(SECURITY_ATTRIBUTES* attributes);
 // Rebuilds published and publishedCount from drives (mutex held).
 void BuildPublishedList(StateBlock* block);
 // Marks a full rescan as wanted (burst, gauge and sleep passes with it).
 void RequestRefresh();
-// The service's work: runs until StopMonitor; the arguments are not used.
-void RunMonitor(int argc, LPWSTR* argv);
+// What the host does around the run: `started` once the state is initialised
+// and every shared object exists, before the service reports running (false
+// ends the run); `ending` after the loop and the pipe server have ended and
+// before any object is closed (only when `started` succeeded). Either may be
+// null.
+struct MonitorSession {
+  bool (*started)();
+  void (*ending)();
+};
+// The service's work: runs until StopMonitor; the arguments are not used. A
+// stop asked for before the run began ends it at once.
+void RunMonitor(int argc, LPWSTR* argv, const MonitorSession* session = nullptr);
 // Signals the UI stop event, the pipe stop event and the stop event (each if
 // it exists). Safe to call from any thread.
 void StopMonitor();

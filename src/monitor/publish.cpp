@@ -2,18 +2,81 @@
 #include <cstring>
 
 #include "monitor/monitor_state.h"
+#include "monitor/null_dacl.h"
 #include "monitor/state_lock.h"
+#include "service/service_host.h"
 #include "transport/status_pages.h"
+
+namespace {
+
+// Row references are addresses inside the service: no copy that leaves it
+// carries them.
+void ClearRowReferences(StateBlock* shared) {
+  for (DriveRecord* list : {shared->drives, shared->published}) {
+    for (int i = 0; i < kMaxDrives; ++i) {
+      list[i].modelSuffixRef = nullptr;
+      list[i].productLineRef = nullptr;
+    }
+  }
+}
+
+// Logs once per episode that the named mapping cannot hold the block (any
+// account may create it first, and smaller).
+void ReportSmallMapping() {
+  if (monitorState.mappingTooSmall != 0) return;
+  monitorState.mappingTooSmall = 1;
+  LogServiceError(WSTR("The shared state mapping is smaller than the state block; not published."));
+}
+
+bool HoldsWholeBlock(HANDLE mapping) {
+  void* view = MapViewOfFile(mapping, FILE_MAP_WRITE, 0, 0, kStateBlockSize);
+  if (view == nullptr) return false;
+  UnmapViewOfFile(view);
+  return true;
+}
+
+HANDLE CreateStateMapping(SECURITY_ATTRIBUTES* attributes) {
+  return CreateFileMappingW(INVALID_HANDLE_VALUE, attributes, PAGE_READWRITE, 0, kStateBlockSize,
+                            kFileMapName);
+}
+
+// The service's own mapping could not be mapped whole: lets go of it and
+// opens the name again, which gives a new mapping of the right size once the
+// other owners of a planted one have closed it (mutex held).
+void* RemapOwnMapping() {
+  NullDaclSecurity security;
+  if (!InitNullDaclSecurity(&security)) return nullptr;
+  if (monitorState.fileMapping != nullptr) CloseHandle(monitorState.fileMapping);
+  monitorState.fileMapping = CreateStateMapping(&security.attributes);
+  if (monitorState.fileMapping == nullptr) return nullptr;
+  return MapViewOfFile(monitorState.fileMapping, FILE_MAP_WRITE, 0, 0, kStateBlockSize);
+}
+
+}  // namespace
+
+HANDLE OpenStateMapping(SECURITY_ATTRIBUTES* attributes) {
+  const HANDLE mapping = CreateStateMapping(attributes);
+  if (mapping != nullptr && !HoldsWholeBlock(mapping)) ReportSmallMapping();
+  return mapping;
+}
 
 void PublishStateBlock(HANDLE mapping, bool force) {
   StateLock lock;
   StateBlock* block = monitorState.stateBlock;
   if (block == nullptr || (monitorState.publishNeeded == 0 && !force)) return;
   monitorState.publishNeeded = 0;
-  void* view = MapViewOfFile(mapping, FILE_MAP_WRITE, 0, 0, kStateBlockSize);
+  const bool own = mapping == nullptr;
+  void* view = MapViewOfFile(own ? monitorState.fileMapping : mapping, FILE_MAP_WRITE, 0, 0,
+                             kStateBlockSize);
+  if (view == nullptr && own) {
+    view = RemapOwnMapping();
+    if (view == nullptr) ReportSmallMapping();
+  }
   if (view == nullptr) return;  // the next forced publish carries the change
+  if (own) monitorState.mappingTooSmall = 0;
   block->sequence += 1;
   std::memcpy(view, block, kStateBlockSize);
+  ClearRowReferences(static_cast<StateBlock*>(view));
   UnmapViewOfFile(view);
   monitorState.publishCount += 1;
   if (monitorHooks.afterPublish != nullptr) monitorHooks.afterPublish(block);

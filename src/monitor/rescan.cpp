@@ -33,8 +33,44 @@ class RescanGuard {
 
 }  // namespace
 
+namespace {
+
+// Waits until every ready event has been signalled once, or the service
+// stops; false on a stop. The events are auto-reset, so each one is waited
+// for until it comes and then left out; the list never holds more than the
+// wait allows, with the stop event first.
+bool WaitForReadyEvents(HANDLE* events, DWORD count) {
+  const HANDLE stop = monitorState.stopEvent;
+  const DWORD first = stop != nullptr ? 1 : 0;
+  while (count > 0) {
+    HANDLE list[MAXIMUM_WAIT_OBJECTS];
+    if (first == 1) list[0] = stop;
+    const DWORD room = MAXIMUM_WAIT_OBJECTS - first;
+    const DWORD listed = count < room ? count : room;
+    for (DWORD i = 0; i < listed; ++i) list[first + i] = events[i];
+    const DWORD wait = WaitForMultipleObjects(first + listed, list, FALSE, INFINITE);
+    if (first == 1 && wait == WAIT_OBJECT_0) return false;
+    const DWORD index = wait - WAIT_OBJECT_0 - first;
+    if (index >= listed) return false;  // failed wait: nothing else would end it
+    events[index] = events[count - 1];
+    --count;
+  }
+  return true;
+}
+
+}  // namespace
+
 void RescanDrives() {
   RescanGuard guard;
+  bool running;
+  {
+    StateLock lock;
+    running = workerState.workerCount != 0;
+  }
+  // The channel table is rebuilt below: workers that a rescan on another
+  // thread started meanwhile (a forwarded resume before the start-up rescan)
+  // are stopped first.
+  if (running) QuiesceChannels();
   HANDLE readyEvents[kMaxChannels];
   DWORD readyCount = 0;
   {
@@ -49,14 +85,33 @@ void RescanDrives() {
       readyEvents[readyCount++] = block->channels[i].readyEvent;
     }
   }
-  // Every worker takes the mutex before it signals, so wait without it.
-  if (readyCount > 0) WaitForMultipleObjects(readyCount, readyEvents, TRUE, INFINITE);
+  // Every worker takes the mutex before it signals, so wait without it. A
+  // stop ends the wait and stops the workers, whatever they are blocked in.
+  const bool ready = WaitForReadyEvents(readyEvents, readyCount);
+  if (!ready) SetEvent(monitorState.workerStopEvent);
   StateLock lock;
-  BuildPublishedList(monitorState.stateBlock);
-  monitorState.stateBlock->statusWord = kStatusRescanDone;
-  monitorState.publishNeeded = 1;
+  if (ready) {
+    BuildPublishedList(monitorState.stateBlock);
+    monitorState.stateBlock->statusWord = kStatusRescanDone;
+    monitorState.publishNeeded = 1;
+    monitorState.rescanCount += 1;
+  }
   monitorState.rescanInProgress = 0;
-  monitorState.rescanCount += 1;
+}
+
+void RestartWorkers() {
+  // The same locks as a quiesce on the pipe thread, so that a restart never
+  // meets workers that are still being stopped.
+  RescanGuard guard;
+  EnterCriticalSection(&workerStopLock);
+  {
+    StateLock lock;
+    if (workerState.workerCount == 0 && workerState.workerHandleCount == 0) {
+      RebuildChannelTable();
+      StartWorkers();
+    }
+  }
+  LeaveCriticalSection(&workerStopLock);
 }
 
 void QuiesceChannels() {
@@ -90,6 +145,8 @@ int CheckRemovedDrives() {
   EnumerateDrives(monitorState.stopEvent);
   AssignVolumeLetters();
   monitorState.driveListStale = 0;
+  // An enumeration cut short by a stop found nothing: that is no removal.
+  if (WaitForSingleObject(monitorState.stopEvent, 0) == WAIT_OBJECT_0) return 0;
   int sent = 0;
   for (int i = 0; i < block->channelCount && i < kMaxChannels; ++i) {
     ChannelRecord& channel = block->channels[i];

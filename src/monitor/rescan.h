@@ -5,7 +5,12 @@
 
 // Enumerates the drives, rebuilds the channel records, starts the workers,
 // waits until each is ready and rebuilds the published list (statusWord 102).
+// A stop ends the wait; the workers are then told to stop and the published
+// list is left as the enumeration left it.
 void RescanDrives();
+// Rebuilds the channel table and starts the workers when none runs; waits
+// for a quiesce in progress first. Called without the mutex.
+void RestartWorkers();
 // Sends the quiesce command where needed and stops all workers.
 void QuiesceChannels();
 // QuiesceChannels then RescanDrives, as one unit that no other rescan overlaps.

@@ -39,9 +39,24 @@ Outcome RunRegistryCommand(BYTE* message, std::size_t delivered) {
   return outcome;
 }
 
+// Takes the state mutex; false when the pipe server is stopped first. Any
+// account may open and hold the mutex, so the wait must also end on a stop.
+bool LockOrStop() {
+  const HANDLE list[2] = {monitorState.pipeStopEvent, monitorState.stateMutex};
+  const DWORD count = list[0] != nullptr ? 2 : 1;
+  const DWORD wait = WaitForMultipleObjects(count, list + (2 - count), FALSE, INFINITE);
+  const DWORD mutexSlot = count - 1;
+  if (count == 2 && wait == WAIT_OBJECT_0) {
+    // The server's own wait must still see the stop, whatever the event's kind.
+    SetEvent(list[0]);
+    return false;
+  }
+  return wait == WAIT_OBJECT_0 + mutexSlot || wait == WAIT_ABANDONED_0 + mutexSlot;
+}
+
 // Carries out one command; the state mutex is held (command 6 lets it go
-// while it runs).
-Outcome RunCommand(BYTE* message, std::size_t delivered) {
+// while it runs, and `*locked` tells whether it has it again).
+Outcome RunCommand(BYTE* message, std::size_t delivered, bool* locked) {
   const DWORD command = ReadField<DWORD>(message, offsetof(CommandMessage, command));
   const DWORD arg1 = ReadField<DWORD>(message, offsetof(CommandMessage, arg1));
   const DWORD arg2 = ReadField<DWORD>(message, offsetof(CommandMessage, arg2));
@@ -59,7 +74,7 @@ Outcome RunCommand(BYTE* message, std::size_t delivered) {
     case kCommandForwardMessage:
       ReleaseMutex(monitorState.stateMutex);
       ForwardMessageRequest(arg1, arg2, arg3, message + offsetof(CommandMessage, resultSlot));
-      WaitForSingleObject(monitorState.stateMutex, INFINITE);
+      *locked = LockOrStop();
       break;
     case kCommandPause:
       monitorState.paused = 1;
@@ -107,12 +122,14 @@ DWORD DispatchRequest(BYTE* request, DWORD received, BYTE* reply) {
   Outcome outcome{0, 0};
   DWORD replyLength = 0;
   if (length >= kCommandMinLength && length <= kCommandMaxLength) {
+    if (!LockOrStop()) return 0;  // stopping: the thread ends without replying
     replyLength = static_cast<DWORD>(length);
-    WaitForSingleObject(monitorState.stateMutex, INFINITE);
-    outcome = RunCommand(request, std::min<std::size_t>(received, replyLength));
+    bool locked = true;
+    outcome = RunCommand(request, std::min<std::size_t>(received, replyLength), &locked);
+    if (!locked) return 0;
     ReleaseMutex(monitorState.stateMutex);
     // The shared block shows the request's effect before the reply leaves.
-    PublishStateBlock(monitorState.fileMapping, true);
+    PublishStateBlock(nullptr, true);
   }
   WriteField<DWORD>(request, offsetof(CommandMessage, result), outcome.result);
   WriteField<DWORD>(request, offsetof(CommandMessage, detail), outcome.detail);

@@ -57,23 +57,18 @@ bool SameSerial(const WCHAR* a, const WCHAR* b) {
   return false;
 }
 
-// The first drive record whose firmware serial equals the image's, or -1.
-int FindDriveByKey(const DriveRecord& image) {
+// The first drive record whose firmware serial equals the key in the image,
+// or -1. Only the key is read from the image: every path the commands open
+// comes from the service's own record, never from a client.
+int FindDriveByKey(const BYTE* driveImage) {
+  WCHAR key[kDriveKeyCapacity];
+  std::memcpy(key, driveImage + kDriveKeyOffsetInImage, sizeof(key));
   StateBlock& block = Block();
   const int count = ClampedCount(block.driveCount, kMaxDrives);
   for (int i = 0; i < count; ++i) {
-    if (SameSerial(block.drives[i].firmwareSerial, image.firmwareSerial)) return i;
+    if (SameSerial(block.drives[i].firmwareSerial, key)) return i;
   }
   return -1;
-}
-
-// A drive image from a message, made safe to hand to service code: its
-// references into the service's model table are meaningless in another
-// process, so they are cleared.
-void LoadImage(const BYTE* driveImage, DriveRecord* image) {
-  std::memcpy(static_cast<void*>(image), driveImage, sizeof(DriveRecord));
-  image->modelSuffixRef = nullptr;
-  image->productLineRef = nullptr;
 }
 
 // The first volume letter a channel shows (its letters are UTF-16 text).
@@ -146,16 +141,13 @@ DWORD RefreshGaugesRequest(DWORD letterArg, DWORD forceResend) {
 }
 
 DWORD ReadStatusRequest(const BYTE* driveImage, BYTE* statusBlock) {
-  DriveRecord image;
-  LoadImage(driveImage, &image);
-  if (FindDriveByKey(image) < 0) return ERROR_INVALID_PARAMETER;
-  return ReadDriveStatus(&image, statusBlock);
+  const int found = FindDriveByKey(driveImage);
+  if (found < 0) return ERROR_INVALID_PARAMETER;
+  return ReadDriveStatus(&Block().drives[found], statusBlock);
 }
 
 DWORD WriteControlRequest(const BYTE* driveImage, const BYTE* controlBlock) {
-  DriveRecord image;
-  LoadImage(driveImage, &image);
-  const int found = FindDriveByKey(image);
+  const int found = FindDriveByKey(driveImage);
   if (found < 0) return ERROR_INVALID_PARAMETER;
   return WriteDriveControl(&Block().drives[found], controlBlock);
 }

@@ -18,6 +18,10 @@ void ForwardMessageRequest(DWORD message, DWORD parameter, DWORD eventData, BYTE
 // Command 9: refreshes the capacity gauges, of all drives (low byte of
 // letterArg 0) or up to the first plain channel showing that letter. Result 1.
 DWORD RefreshGaugesRequest(DWORD letterArg, DWORD forceResend);
+// Commands 11 and 12 read only the firmware serial of the client's drive
+// image: they act on the service's own record of the drive with that serial,
+// so no path a client sent is ever opened.
+//
 // Command 11: reads the status page of the drive named by the image's firmware
 // serial into statusBlock[8]. The status code, or ERROR_INVALID_PARAMETER
 // when no drive has that serial.

@@ -4,9 +4,9 @@
 // Header-only, so that a client needs nothing but the platform layer.
 //
 // OpenCommandPipe(busyWaitMs): opens "\\.\pipe\QxSvcPipe" for reading and
-//   writing in message mode; while every instance is busy it waits up to
-//   busyWaitMs for one to free up. INVALID_HANDLE_VALUE (last error set) on
-//   failure.
+//   writing in message mode, letting the server identify the caller but not
+//   impersonate it; while every instance is busy it waits up to busyWaitMs
+//   for one to free up. INVALID_HANDLE_VALUE (last error set) on failure.
 // ExchangeCommand: writes `length` bytes of `request` as one message and reads
 //   the reply message into reply[capacity]. False (last error set) when either
 //   fails; an empty reply is a success with *replyLength 0.
@@ -27,10 +27,15 @@
 #include "platform/wide.h"
 #include "platform/win32.h"
 
+// Quality of service for the open: whoever serves the name may identify the
+// client but never impersonate it (SECURITY_SQOS_PRESENT |
+// SECURITY_IDENTIFICATION, as the system headers define them).
+inline constexpr DWORD kPipeClientSecurityFlags = 0x00100000 | 0x00010000;
+
 inline HANDLE OpenCommandPipe(DWORD busyWaitMs) {
   for (int attempt = 0; attempt < 2; ++attempt) {
-    HANDLE pipe =
-        CreateFileW(kPipeName, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr);
+    HANDLE pipe = CreateFileW(kPipeName, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING,
+                              kPipeClientSecurityFlags, nullptr);
     if (pipe != INVALID_HANDLE_VALUE) {
       DWORD mode = PIPE_READMODE_MESSAGE;
       if (!SetNamedPipeHandleState(pipe, &mode, nullptr, nullptr)) {

@@ -5,6 +5,7 @@
 #include "monitor/monitor_state.h"
 #include "pipe/dispatcher.h"
 #include "pipe/pipe_instance.h"
+#include "service/service_host.h"
 
 namespace {
 
@@ -14,13 +15,39 @@ constexpr DWORD kPipeMaxInstances = kPipeInstanceCount;
 constexpr DWORD kPipeOpenMode = PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED;
 constexpr DWORD kPipeMode = PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT;
 constexpr DWORD kPipeDefaultTimeout = 5000;
+// An instance that cannot be created or connected is tried again after this
+// pause, doubled at every further failure up to the limit.
+constexpr DWORD kRetryFirstMs = 500;
+constexpr DWORD kRetryLimitMs = 30000;
 
 PipeInstance instances[kPipeInstanceCount];
-// Slot 0: the stop event; slot k: the event of instance k - 1.
-HANDLE waitList[kPipeInstanceCount + 1];
 
-// Starts waiting for a client on the instance.
-void ConnectInstance(PipeInstance& instance) {
+// Instances that wait to be created again: the time it is due (0: the
+// instance is open) and the pause used last.
+struct Retry {
+  ULONGLONG dueAt;
+  DWORD pauseMs;
+};
+Retry retries[kPipeInstanceCount];
+bool failureLogged;  // an event reports instances that are not open
+int scanStart;       // the wait list starts with this instance; rotates
+
+DWORD PipeMode() {
+  // Remote clients are refused where the system knows the flag (major
+  // version 6 and later); the pipe is meant for the local application only.
+  const DWORD major = GetVersion() & 0xFF;
+  return kPipeMode | (major >= 6 ? PIPE_REJECT_REMOTE_CLIENTS : 0);
+}
+
+bool AnyPipeOpen() {
+  for (const PipeInstance& instance : instances) {
+    if (instance.pipe != nullptr) return true;
+  }
+  return false;
+}
+
+// Starts waiting for a client on the instance; false on an unexpected error.
+bool ConnectInstance(PipeInstance& instance) {
   bool pending = false;
   if (!ConnectNamedPipe(instance.pipe, &instance.overlapped)) {
     switch (GetLastError()) {
@@ -37,41 +64,97 @@ void ConnectInstance(PipeInstance& instance) {
         SetEvent(instance.overlapped.hEvent);
         break;
       default:
-        break;
+        return false;
     }
   }
   instance.pending = pending ? TRUE : FALSE;
   instance.state = pending ? kPipeConnecting : kPipeReading;
-}
-
-void ReconnectInstance(PipeInstance& instance) {
-  DisconnectNamedPipe(instance.pipe);
-  ConnectInstance(instance);
-}
-
-// Creates instance `index` with its event; false when either cannot be made.
-bool CreateInstance(int index) {
-  PipeInstance& instance = instances[index];
-  std::memset(&instance, 0, sizeof(instance));
-  if (!InitNullDaclSecurity(&instance.security)) return false;
-  HANDLE event = CreateEventW(&instance.security.attributes, TRUE, TRUE, nullptr);
-  if (event == nullptr) return false;
-  instance.overlapped.hEvent = event;
-  waitList[index + 1] = event;
-  // The first instance claims the name: if another process holds it, the
-  // creation fails and the service runs without a command channel.
-  const DWORD openMode = kPipeOpenMode | (index == 0 ? FILE_FLAG_FIRST_PIPE_INSTANCE : 0);
-  HANDLE pipe = CreateNamedPipeW(kPipeName, openMode, kPipeMode, kPipeMaxInstances, kPipeReadSize,
-                                 kPipeReadSize, kPipeDefaultTimeout, &instance.security.attributes);
-  if (pipe == INVALID_HANDLE_VALUE) return false;
-  instance.pipe = pipe;
   return true;
 }
 
-// Closes what the first `count` instances hold, ending their exchanges.
-void CloseInstances(int count) {
-  for (int i = 0; i < count; ++i) {
-    PipeInstance& instance = instances[i];
+// Closes the instance's pipe (its event stays) and schedules it to be
+// created again; the first of a run of failures is logged.
+void SetAside(int index) {
+  PipeInstance& instance = instances[index];
+  if (instance.pipe != nullptr) {
+    if (instance.pending) {
+      DWORD ignored = 0;
+      CancelIo(instance.pipe);
+      GetOverlappedResult(instance.pipe, &instance.overlapped, &ignored, TRUE);
+    }
+    CloseHandle(instance.pipe);
+    instance.pipe = nullptr;
+  }
+  instance.pending = FALSE;
+  Retry& retry = retries[index];
+  retry.pauseMs = retry.pauseMs == 0 ? kRetryFirstMs : retry.pauseMs * 2;
+  if (retry.pauseMs > kRetryLimitMs) retry.pauseMs = kRetryLimitMs;
+  retry.dueAt = GetTickCount64() + retry.pauseMs;
+  if (!failureLogged) {
+    failureLogged = true;
+    LogServiceError(WSTR("An instance of the command pipe cannot be opened; trying again."));
+  }
+}
+
+// Creates instance `index` (its event once) and connects it; false when
+// either step fails.
+bool OpenInstance(int index) {
+  PipeInstance& instance = instances[index];
+  HANDLE event = instance.overlapped.hEvent;
+  std::memset(&instance, 0, sizeof(instance));
+  if (!InitNullDaclSecurity(&instance.security)) return false;
+  if (event == nullptr) event = CreateEventW(&instance.security.attributes, TRUE, TRUE, nullptr);
+  instance.overlapped.hEvent = event;
+  if (event == nullptr) return false;
+  // While none of ours exists the instance must be the first of the name:
+  // if another process holds it, the creation fails instead of joining it.
+  const DWORD openMode = kPipeOpenMode | (AnyPipeOpen() ? 0 : FILE_FLAG_FIRST_PIPE_INSTANCE);
+  HANDLE pipe = CreateNamedPipeW(kPipeName, openMode, PipeMode(), kPipeMaxInstances, kPipeReadSize,
+                                 kPipeReadSize, kPipeDefaultTimeout, &instance.security.attributes);
+  if (pipe == INVALID_HANDLE_VALUE) return false;
+  instance.pipe = pipe;
+  return ConnectInstance(instance);
+}
+
+void OpenOrSetAside(int index) {
+  if (OpenInstance(index)) {
+    retries[index].dueAt = 0;
+  } else {
+    SetAside(index);
+  }
+}
+
+// Opens the instances whose retry is due; the wait's time-out until the next
+// one (INFINITE when none waits).
+DWORD RetryDueInstances() {
+  ULONGLONG now = GetTickCount64();
+  ULONGLONG next = 0;
+  bool allOpen = true;
+  for (int i = 0; i < kPipeInstanceCount; ++i) {
+    if (retries[i].dueAt != 0 && retries[i].dueAt <= now) {
+      OpenOrSetAside(i);
+      now = GetTickCount64();
+    }
+    if (retries[i].dueAt != 0) {
+      allOpen = false;
+      if (next == 0 || retries[i].dueAt < next) next = retries[i].dueAt;
+    }
+  }
+  if (allOpen) {
+    failureLogged = false;
+    return INFINITE;
+  }
+  return next > now ? static_cast<DWORD>(next - now) : 0;
+}
+
+void ReconnectInstance(int index) {
+  DisconnectNamedPipe(instances[index].pipe);
+  if (!ConnectInstance(instances[index])) SetAside(index);
+}
+
+// Closes what the instances hold, ending their exchanges.
+void CloseInstances() {
+  for (PipeInstance& instance : instances) {
     if (instance.pipe != nullptr) {
       if (instance.pending) {
         DWORD ignored = 0;
@@ -85,24 +168,29 @@ void CloseInstances(int count) {
       CloseHandle(instance.overlapped.hEvent);
       instance.overlapped.hEvent = nullptr;
     }
-    waitList[i + 1] = nullptr;
   }
 }
 
 // Takes the result of the instance's finished operation. Returns false when
 // the thread must end; sets `served` to false when the instance was
-// reconnected and needs nothing more this round.
-bool CompletePending(PipeInstance& instance, bool* served) {
+// reconnected or set aside and needs nothing more this round.
+bool CompletePending(int index, bool* served) {
+  PipeInstance& instance = instances[index];
   DWORD count = 0;
   const BOOL done = GetOverlappedResult(instance.pipe, &instance.overlapped, &count, FALSE);
+  instance.pending = FALSE;
   switch (instance.state) {
     case kPipeConnecting:
-      if (!done) return false;
+      if (!done) {
+        SetAside(index);
+        *served = false;
+        return true;
+      }
       instance.state = kPipeReading;
       return true;
     case kPipeReading:
       if (!done || count == 0) {
-        ReconnectInstance(instance);
+        ReconnectInstance(index);
         *served = false;
         return true;
       }
@@ -111,7 +199,7 @@ bool CompletePending(PipeInstance& instance, bool* served) {
       return true;
     case kPipeWriting:
       if (!done || count != instance.replyLength) {
-        ReconnectInstance(instance);
+        ReconnectInstance(index);
         *served = false;
         return true;
       }
@@ -122,7 +210,8 @@ bool CompletePending(PipeInstance& instance, bool* served) {
   }
 }
 
-void StartRead(PipeInstance& instance) {
+void StartRead(int index) {
+  PipeInstance& instance = instances[index];
   DWORD count = 0;
   if (ReadFile(instance.pipe, instance.request, kPipeReadSize, &count, &instance.overlapped)) {
     if (count != 0) {
@@ -137,11 +226,13 @@ void StartRead(PipeInstance& instance) {
     return;
   }
   // An empty message, one longer than the buffer, or a broken pipe.
-  ReconnectInstance(instance);
+  ReconnectInstance(index);
 }
 
-void StartWrite(PipeInstance& instance) {
+void StartWrite(int index) {
+  PipeInstance& instance = instances[index];
   DispatchCommand(&instance);
+  retries[index].pauseMs = 0;  // the instance works: a later failure starts afresh
   DWORD count = 0;
   if (WriteFile(instance.pipe, instance.reply, instance.replyLength, &count,
                 &instance.overlapped)) {
@@ -154,39 +245,55 @@ void StartWrite(PipeInstance& instance) {
     instance.pending = TRUE;
     return;
   }
-  ReconnectInstance(instance);
+  ReconnectInstance(index);
 }
 
 }  // namespace
 
 DWORD WINAPI PipeServerThread(LPVOID) {
-  waitList[0] = monitorState.pipeStopEvent;
-  int created = 0;
-  for (; created < kPipeInstanceCount; ++created) {
-    if (!CreateInstance(created)) {
-      CloseInstances(created + 1);
-      return 0;
-    }
-    ConnectInstance(instances[created]);
+  const HANDLE stop = monitorState.pipeStopEvent;
+  failureLogged = false;
+  scanStart = 0;
+  for (int i = 0; i < kPipeInstanceCount; ++i) {
+    instances[i].overlapped.hEvent = nullptr;
+    instances[i].pipe = nullptr;
+    retries[i] = Retry{0, 0};
+    OpenOrSetAside(i);
   }
 
   for (;;) {
-    const DWORD wait = WaitForMultipleObjects(kPipeInstanceCount + 1, waitList, FALSE, INFINITE);
+    const DWORD timeout = RetryDueInstances();
+    // Slot 0: the stop event; then the open instances, starting after the
+    // one served last, so that a busy client cannot starve the others.
+    HANDLE waitList[kPipeInstanceCount + 1];
+    int instanceOf[kPipeInstanceCount + 1];
+    DWORD listed = 0;
+    waitList[listed++] = stop;
+    for (int k = 0; k < kPipeInstanceCount; ++k) {
+      const int i = (scanStart + k) % kPipeInstanceCount;
+      if (instances[i].pipe == nullptr) continue;
+      instanceOf[listed] = i;
+      waitList[listed++] = instances[i].overlapped.hEvent;
+    }
+    const DWORD wait = WaitForMultipleObjects(listed, waitList, FALSE, timeout);
     if (wait == WAIT_OBJECT_0) break;  // stop, even with exchanges in progress
-    const DWORD index = wait - WAIT_OBJECT_0 - 1;
-    if (index >= static_cast<DWORD>(kPipeInstanceCount)) break;  // failed or abandoned
+    if (wait == WAIT_TIMEOUT) continue;
+    const DWORD slot = wait - WAIT_OBJECT_0;
+    if (slot >= listed) break;  // failed or abandoned
+    const int index = instanceOf[slot];
+    scanStart = (index + 1) % kPipeInstanceCount;
     PipeInstance& instance = instances[index];
 
     bool served = true;
-    if (instance.pending && !CompletePending(instance, &served)) break;
+    if (instance.pending && !CompletePending(index, &served)) break;
     if (!served) continue;
 
     if (instance.state == kPipeReading) {
-      StartRead(instance);
+      StartRead(index);
     } else if (instance.state == kPipeWriting) {
-      StartWrite(instance);
+      StartWrite(index);
     }
   }
-  CloseInstances(created);
+  CloseInstances();
   return 0;
 }

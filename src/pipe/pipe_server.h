@@ -6,8 +6,10 @@
 #include "platform/win32.h"
 
 // Started by the monitor once the state block, its mutex and its mapping
-// exist; ends when monitorState.pipeStopEvent is signalled. Returns 0 on every
-// path, also when the pipe cannot be created (the service then runs on
-// without a command channel). The thread closes its pipes and events before it
+// exist; ends when monitorState.pipeStopEvent is signalled, with exit code 0.
+// An instance that cannot be created or connected (another process holds the
+// name, or took one of the instances) is logged once and tried again with a
+// growing pause; the others serve meanwhile. Each wait starts its scan after
+// the instance served last. The thread closes its pipes and events before it
 // ends.
 DWORD WINAPI PipeServerThread(LPVOID parameter);

@@ -13,12 +13,16 @@ constexpr std::size_t kTextCapacity =
     (kCommandMaxLength - kRegistryRequestOffset - kRegistryPathOffset) / 2 + 1;
 
 // Only the predefined roots are accepted: any other number would name a
-// handle of the service itself.
+// handle of the service itself. A 64-bit client sends a root sign-extended
+// (0xFFFFFFFF80000002), a 32-bit one zero-extended (0x80000002); both name
+// the same root.
 bool PredefinedRoot(std::uint64_t value, HKEY* root) {
   const HKEY roots[] = {HKEY_CLASSES_ROOT, HKEY_CURRENT_USER, HKEY_LOCAL_MACHINE, HKEY_USERS,
                         HKEY_CURRENT_CONFIG};
   for (HKEY candidate : roots) {
-    if (static_cast<std::uint64_t>(reinterpret_cast<std::uintptr_t>(candidate)) == value) {
+    const auto signExtended =
+        static_cast<std::uint64_t>(reinterpret_cast<std::uintptr_t>(candidate));
+    if (value == signExtended || value == (signExtended & 0xFFFFFFFFu)) {
       *root = candidate;
       return true;
     }

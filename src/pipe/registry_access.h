@@ -11,7 +11,8 @@
 // that starts at `request`, in place. `available` is the number of bytes from
 // `request` on that the client actually delivered: the subkey path, the value
 // name and the data area must lie inside them (path and name terminated), and
-// the root key must be a predefined one, or the request is refused with
-// ERROR_INVALID_PARAMETER without touching the registry. Returns the registry
-// error code (ERROR_SUCCESS on success).
+// the root key must be a predefined one, sign- or zero-extended from its 32-bit
+// value; otherwise the request is refused with ERROR_INVALID_PARAMETER without
+// touching the registry. Returns the registry error code (ERROR_SUCCESS on
+// success).
 DWORD RunRegistryRequest(BYTE* request, std::size_t available);

@@ -1,5 +1,6 @@
 // The -debug verb: the monitor in the foreground, stopped with Ctrl+C.
 #include "monitor/monitor_state.h"
+#include "monitor/stop_request.h"
 #include "service/service_host.h"
 
 void CmdDebugService() {
@@ -10,6 +11,9 @@ void CmdDebugService() {
     return;
   }
   ConsolePrint(WideString(WSTR("Debugging ")) + SKYVANE_DISPLAY_NAME + WSTR(".\r\n"));
+  // Only a Ctrl+C from now on counts; one that comes before the monitor's
+  // events exist is kept for it.
+  monitorStopRequested = false;
   SetConsoleCtrlHandler(ConsoleControlHandler, TRUE);
   RunMonitor(argc, argv);
   LocalFree(argv);

@@ -16,6 +16,9 @@ void InstallService() {
     ConsolePrint(WithErrorText(line + WSTR(" - ")));
     return;
   }
+  // Quoted, so that a path with blanks cannot be read as a shorter program
+  // followed by arguments.
+  const WideString image = WideString(WSTR("\"")) + path + WSTR("\"");
   SC_HANDLE manager =
       OpenSCManagerW(nullptr, nullptr, SC_MANAGER_CONNECT | SC_MANAGER_CREATE_SERVICE);
   if (manager == nullptr) {
@@ -24,8 +27,8 @@ void InstallService() {
   }
   SC_HANDLE service =
       CreateServiceW(manager, SKYVANE_SERVICE_NAME, SKYVANE_DISPLAY_NAME, SERVICE_ALL_ACCESS,
-                     SERVICE_WIN32_OWN_PROCESS, SERVICE_AUTO_START, SERVICE_ERROR_NORMAL, path,
-                     nullptr, nullptr, WSTR("\0\0"), nullptr, nullptr);
+                     SERVICE_WIN32_OWN_PROCESS, SERVICE_AUTO_START, SERVICE_ERROR_NORMAL,
+                     image.c_str(), nullptr, nullptr, WSTR("\0\0"), nullptr, nullptr);
   if (service == nullptr) {
     ConsolePrint(WithErrorText(WSTR("CreateService failed - ")));
     CloseServiceHandle(manager);

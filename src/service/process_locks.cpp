@@ -4,6 +4,7 @@ CRITICAL_SECTION passThroughLock;
 CRITICAL_SECTION workerStopLock;
 CRITICAL_SECTION rescanLock;
 CRITICAL_SECTION serviceStatusLock;
+CRITICAL_SECTION deviceEventLock;
 
 void InitializeProcessLocks() {
   static const bool initialized = [] {
@@ -11,6 +12,7 @@ void InitializeProcessLocks() {
     InitializeCriticalSection(&workerStopLock);
     InitializeCriticalSection(&rescanLock);
     InitializeCriticalSection(&serviceStatusLock);
+    InitializeCriticalSection(&deviceEventLock);
     return true;
   }();
   (void)initialized;

@@ -15,6 +15,9 @@ extern CRITICAL_SECTION serviceStatusLock;
 // Keeps two full rescans (monitor thread, forwarded resume on the pipe
 // thread) from overlapping. Taken before every other lock.
 extern CRITICAL_SECTION rescanLock;
+// Keeps a device event out of the monitor while it starts or ends; held
+// while the event is handled, so taken before the state mutex.
+extern CRITICAL_SECTION deviceEventLock;
 
 // Initialises both locks; later calls do nothing (tests start the service
 // many times in one process).

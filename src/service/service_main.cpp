@@ -2,6 +2,7 @@
 #include "service/service_main.h"
 
 #include "monitor/monitor_state.h"
+#include "monitor/stop_request.h"
 #include "service/device_notifications.h"
 #include "service/process_locks.h"
 #include "service/service_host.h"
@@ -30,16 +31,48 @@ bool ReportServiceStatus(DWORD state, DWORD exitCode, DWORD waitHintMs) {
   return sent;
 }
 
+namespace {
+
+// Device events reach the monitor only while its state and objects exist;
+// guarded by deviceEventLock.
+bool deviceEventsAccepted = false;
+
+void AcceptDeviceEvents(bool accepted) {
+  EnterCriticalSection(&deviceEventLock);
+  deviceEventsAccepted = accepted;
+  LeaveCriticalSection(&deviceEventLock);
+}
+
+// Registered once the monitor has initialised its state.
+bool StartDeviceNotifications() {
+  AcceptDeviceEvents(true);
+  if (RegisterDeviceInterfaceNotifications(DEVICE_NOTIFY_SERVICE_HANDLE, serviceStatusHandle))
+    return true;
+  AcceptDeviceEvents(false);
+  return false;
+}
+
+// Removed before the monitor closes its objects; a handler already running
+// finishes first.
+void EndDeviceNotifications() {
+  UnregisterDeviceInterfaceNotifications();
+  AcceptDeviceEvents(false);
+}
+
+}  // namespace
+
 VOID WINAPI RunService(DWORD argc, LPWSTR* argv) {
+  InitializeProcessLocks();
+  // A new run: only a stop that comes from now on counts.
+  monitorStopRequested = false;
   serviceStatusHandle =
       RegisterServiceCtrlHandlerExW(SKYVANE_SERVICE_NAME, ServiceControlHandler, nullptr);
   if (serviceStatusHandle == nullptr) return;
   serviceStatus.dwServiceType = SERVICE_WIN32_OWN_PROCESS;
   serviceStatus.dwServiceSpecificExitCode = 0;
-  if (ReportServiceStatus(SERVICE_START_PENDING, 0, 3000) &&
-      RegisterDeviceInterfaceNotifications(DEVICE_NOTIFY_SERVICE_HANDLE, serviceStatusHandle)) {
-    RunMonitor(static_cast<int>(argc), argv);
-    UnregisterDeviceInterfaceNotifications();
+  if (ReportServiceStatus(SERVICE_START_PENDING, 0, 3000)) {
+    const MonitorSession session{StartDeviceNotifications, EndDeviceNotifications};
+    RunMonitor(static_cast<int>(argc), argv, &session);
   }
   ReportServiceStatus(SERVICE_STOPPED, lastError, 0);
 }
@@ -63,7 +96,10 @@ DWORD WINAPI ServiceControlHandler(DWORD control, DWORD eventType, LPVOID eventD
       StopMonitor();
       return NO_ERROR;
     case SERVICE_CONTROL_DEVICEEVENT:
-      HandleDeviceEvent(eventType, eventData, nullptr);
+      InitializeProcessLocks();
+      EnterCriticalSection(&deviceEventLock);
+      if (deviceEventsAccepted) HandleDeviceEvent(eventType, eventData, nullptr);
+      LeaveCriticalSection(&deviceEventLock);
       break;
     default:
       break;

@@ -59,6 +59,23 @@ wait $HOLDER_PID || fail "holder did not see statusWord 500"
 HOLDER_PID=
 [ "$(field statusWord "$WORK/last.json")" = 500 ] || fail "last statusWord"
 
+# A stop while a client streams gauge refreshes (command 9 aborts on the
+# pipe stop) reaches STOPPED within 5 s.
+w sc start SkyvaneSvc >/dev/null 2>&1
+wait_state RUNNING || fail "service did not start for the streaming stop"
+(while :; do w "$CLIENT" send 10920 9 0 1 >/dev/null 2>&1 || sleep 0.1; done) &
+STREAM_PID=$!
+sleep 2
+w sc stop SkyvaneSvc >"$WORK/stop2.txt" 2>&1
+# Counted from the delivered control; each query starts a Wine process, so
+# the bound is checked in whole seconds.
+START=$(date +%s)
+wait_state STOPPED || fail "service did not stop while a client streamed"
+ELAPSED=$(($(date +%s) - START))
+kill "$STREAM_PID" 2>/dev/null
+wait "$STREAM_PID" 2>/dev/null
+[ "$ELAPSED" -le 5 ] || fail "stop took $ELAPSED s while a client streamed"
+
 # Installing again names the existing service.
 w "$SVC" -install >"$WORK/install2.txt" 2>&1
 tr -d '\r' <"$WORK/install2.txt" | grep -q "^CreateService failed - .* (0x431)$" || fail "second install"
@@ -71,6 +88,18 @@ tr -d '\r' <"$WORK/remove.txt" | grep -q "^Stopping Skyvane Service\." || fail "
 tr -d '\r' <"$WORK/remove.txt" | grep -q "Skyvane Service stopped\.$" || fail "stopped line"
 has_line "Skyvane Service removed." "$WORK/remove.txt" || fail "removed line"
 w sc query SkyvaneSvc >/dev/null 2>&1 && fail "service still installed"
+
+# Installed from a path with blanks, the image path is quoted.
+mkdir -p "$WORK/with blanks"
+cp "$SVC" "$WORK/with blanks/SkyvaneSvc.exe"
+w "$WORK/with blanks/SkyvaneSvc.exe" -install >"$WORK/install3.txt" 2>&1
+has_line "Skyvane Service installed." "$WORK/install3.txt" || fail "install from a path with blanks"
+w reg query 'HKLM\System\CurrentControlSet\Services\SkyvaneSvc' /v ImagePath >"$WORK/image.txt" 2>&1
+tr -d '\r' <"$WORK/image.txt" | grep -q 'ImagePath.*REG_EXPAND_SZ *".*with blanks.SkyvaneSvc\.exe"$' ||
+  tr -d '\r' <"$WORK/image.txt" | grep -q 'ImagePath.*REG_SZ *".*with blanks.SkyvaneSvc\.exe"$' ||
+  fail "image path not quoted"
+w "$WORK/with blanks/SkyvaneSvc.exe" -remove >"$WORK/remove3.txt" 2>&1
+has_line "Skyvane Service removed." "$WORK/remove3.txt" || fail "remove after install with blanks"
 
 # Nothing of ours keeps running (Wine shows a program as its Windows path).
 OURS='^[A-Za-z]:.*[\\/](SkyvaneSvc|skyvane)\.exe'

@@ -1,8 +1,11 @@
 #!/usr/bin/env python3
-"""Writes the seed corpus of the command channel's fuzz target into corpus/.
+"""Writes the seed corpora of the command channel's fuzz targets.
 
-Each seed is one selector byte (even: a pipe message for the dispatcher; odd:
-a registry request alone) followed by the input.
+corpus/: each seed is one selector byte (even: a pipe message for the
+dispatcher; odd: a registry request alone) followed by the input.
+corpus_drives/: each seed is one selector byte (low three bits: command 1, 2,
+3, 9, 11, 12; 0x08: paused; high four bits: the drive whose key the image
+carries) followed by the message.
 """
 import os
 import struct
@@ -26,13 +29,22 @@ def registry(root, path, name, operation, value_type, data, data_length=None):
     return fixed + p + n + data
 
 
+IMAGE_AT = 2180
+# Paths in a drive image: disk, channel, control, HID.
+IMAGE_PATHS = (3452, 3964, 4512, 5024)
+
+
 def message(command, arg1=0, arg2=0, arg3=0, length=MAX, registry_request=b"", size=None,
-            key=None):
+            key=None, paths=None, control=b""):
     body = bytearray(MAX)
     struct.pack_into("<QIIII", body, 0, length, command, arg1, arg2, arg3)
     if key is not None:
         k = text(key)
         body[2764:2764 + len(k)] = k
+    for at, path in zip(IMAGE_PATHS, paths or ()):
+        p = text(path)
+        body[IMAGE_AT + at:IMAGE_AT + at + len(p)] = p
+    body[9828:9828 + len(control)] = control
     body[REG_AT:REG_AT + len(registry_request)] = registry_request
     return bytes(body[: MAX if size is None else size])
 
@@ -58,6 +70,8 @@ SEEDS = {
     "d_reg_partial": message(13, registry_request=registry(HKLM, "Software", "Name", 1, 1,
                                                             text("v")), size=REG_AT + 60),
     "d_head_only": message(10, 7, size=64),
+    "d_reg_root32": message(13, registry_request=registry(HKLM & 0xFFFFFFFF, "Software", "", 2,
+                                                           0, b"")),
     "r_query": registry(HKCU, "", "FuzzValue", 0, 0, bytes(16)),
     "r_set_sz": registry(HKCU, "", "FuzzText", 1, 1, text("hello")),
     "r_other_operation": registry(HKLM, "", "", 2, 0, b""),
@@ -68,14 +82,43 @@ SEEDS = {
 }
 
 
+# Disk, channel, control and HID paths of a client's own: a share and pipes.
+FOREIGN = ("\\\\.\\pipe\\x", "\\\\.\\pipe\\x", "\\\\attacker\\share\\x",
+           "\\\\?\\UNC\\attacker\\share")
+
+# selector, message
+DRIVE_SEEDS = {
+    "remove_first": (0x00, message(1, 0)),
+    "remove_paused": (0x08, message(1, 0)),
+    "remove_beyond": (0xF0, message(1, 9)),
+    "release_second": (0x11, message(2, 1)),
+    "release_also_third": (0x22, message(3, 2)),
+    "gauges_all_forced": (0x03, message(9, 0, 1)),
+    "gauges_letter": (0x03, message(9, ord("F"), 0)),
+    "status_first": (0x04, message(11, paths=FOREIGN)),
+    "status_second": (0x14, message(11, paths=FOREIGN)),
+    "status_third": (0x24, message(11, paths=FOREIGN)),
+    "status_fourth": (0x34, message(11, paths=FOREIGN)),
+    "status_unknown_key": (0xF4, message(11, key="NO-SUCH-DRIVE", paths=FOREIGN)),
+    "control_first": (0x05, message(12, paths=FOREIGN, control=bytes([1, 0, 0, 0, 0, 0, 0, 0]))),
+    "control_third": (0x25, message(12, paths=FOREIGN, control=bytes(range(8)))),
+}
+
+
+def write(folder, seeds):
+    os.makedirs(folder, exist_ok=True)
+    for name, data in seeds.items():
+        with open(os.path.join(folder, name), "wb") as f:
+            f.write(data)
+
+
 def main():
     here = os.path.dirname(os.path.abspath(__file__))
-    out = os.path.join(here, "corpus")
-    os.makedirs(out, exist_ok=True)
-    for name, data in SEEDS.items():
-        selector = b"\x00" if name.startswith("d_") else b"\x01"
-        with open(os.path.join(out, name), "wb") as f:
-            f.write(selector + data)
+    write(os.path.join(here, "corpus"),
+          {name: (b"\x00" if name.startswith("d_") else b"\x01") + data
+           for name, data in SEEDS.items()})
+    write(os.path.join(here, "corpus_drives"),
+          {name: bytes([selector]) + data for name, (selector, data) in DRIVE_SEEDS.items()})
 
 
 if __name__ == "__main__":

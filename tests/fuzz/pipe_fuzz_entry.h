@@ -6,7 +6,9 @@
 //         dispatcher with the count of bytes received;
 //   odd:  a registry request (fixed part and texts) of exactly that many
 //         bytes delivered, fed to the registry access alone.
-// Invariants of the reply are checked; a violation aborts.
+// The dispatcher runs on a computer without drives. Every reply must pass the
+// checks of fuzz_support.h, and no path may be opened at all; a refused
+// registry request stays unchanged. A violation aborts.
 #pragma once
 
 #include <cstddef>

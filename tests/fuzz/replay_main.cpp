@@ -6,7 +6,13 @@
 #include <iterator>
 #include <vector>
 
+#include "drive_fuzz_entry.h"
 #include "pipe_fuzz_entry.h"
+
+// Built once per fuzzing entry.
+#ifndef FUZZ_ENTRY
+#define FUZZ_ENTRY PipeFuzzOneInput
+#endif
 
 namespace {
 
@@ -18,7 +24,7 @@ bool RunFile(const std::filesystem::path& path) {
   }
   const std::vector<char> bytes((std::istreambuf_iterator<char>(file)),
                                 std::istreambuf_iterator<char>());
-  PipeFuzzOneInput(reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size());
+  FUZZ_ENTRY(reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size());
   return true;
 }
 

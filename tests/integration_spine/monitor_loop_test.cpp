@@ -3,18 +3,28 @@
 // monitor thread between passes, so the sequence of passes is deterministic.
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <condition_variable>
+#include <cstdio>
 #include <cstdlib>
 #include <functional>
+#include <memory>
 #include <mutex>
+#include <string>
 #include <thread>
 #include <vector>
 
+#include "machine.h"
+#include "monitor/channel_workers.h"
 #include "monitor/monitor_state.h"
+#include "monitor/rescan.h"
 #include "monitor/state_lock.h"
+#include "pipe/pipe_client.h"
 #include "platform/diagnostics.h"
+#include "platform/posix/emu_scm.h"
 #include "service/process_locks.h"
 #include "service/service_host.h"
+#include "support/test_support.h"
 
 namespace {
 
@@ -84,9 +94,19 @@ class MonitorLoop : public ::testing::Test {
     }
     monitorHooks = MonitorHooks{};
     observer = nullptr;
+    debugMode = true;
+    if (machine_ != nullptr) {
+      machine_->ClearFaults();
+      machine_->FinishHeldCancels();
+      machine_->Uninstall();
+    }
   }
   // Runs the monitor until `script` stops it; returns when RunMonitor did.
   void Run(std::function<void(const std::vector<Pass>&)> script) {
+    Start(std::move(script));
+    Finish();
+  }
+  void Start(std::function<void(const std::vector<Pass>&)> script) {
     observer_.script = std::move(script);
     monitor_ = std::thread([this] {
       RunMonitor(0, nullptr);
@@ -94,12 +114,43 @@ class MonitorLoop : public ::testing::Test {
       observer_.finished = true;
       observer_.changed.notify_all();
     });
+  }
+  // Waits for RunMonitor to return; a monitor that never stops ends the
+  // program, since its thread cannot be joined.
+  void Finish() {
     std::unique_lock<std::mutex> guard(observer_.lock);
-    ASSERT_TRUE(observer_.changed.wait_for(guard, std::chrono::seconds(120), [this] {
-      return observer_.finished;
-    })) << "the monitor did not stop";
+    if (!observer_.changed.wait_for(guard, std::chrono::seconds(60),
+                                    [this] { return observer_.finished; })) {
+      std::fprintf(stderr, "the monitor did not stop\n");
+      std::abort();
+    }
     guard.unlock();
     monitor_.join();
+  }
+  // Waits (real time, guarded) until `done` holds.
+  static bool WaitUntil(const std::function<bool()>& done) {
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+    while (!done()) {
+      if (std::chrono::steady_clock::now() > deadline) return false;
+      std::this_thread::sleep_for(std::chrono::milliseconds(2));
+    }
+    return true;
+  }
+  std::size_t PassCount() {
+    std::lock_guard<std::mutex> guard(observer_.lock);
+    return observer_.passes.size();
+  }
+  // Installs the embedded default machine: one drive per channel kind.
+  void InstallDefaultMachine() {
+    std::string error;
+    machine_ = sim::LoadMachine(sim::DefaultMachineText(), &error);
+    ASSERT_NE(machine_, nullptr) << error;
+    machine_->SetDeviceEventSink([](DWORD, const void*) {});
+    machine_->Install();
+  }
+  static DWORD Read(DWORD MonitorState::*flag) {
+    StateLock lock;
+    return monitorState.*flag;
   }
   static void Set(DWORD MonitorState::*flag, DWORD value) {
     StateLock lock;
@@ -112,6 +163,7 @@ class MonitorLoop : public ::testing::Test {
   }
   Observer observer_;
   std::thread monitor_;
+  std::unique_ptr<sim::Machine> machine_;
 };
 
 TEST_F(MonitorLoop, WithoutDrivesPublishesAtLeastEveryFifthTick) {
@@ -289,6 +341,174 @@ TEST_F(MonitorLoop, FailedStartUpTearsDownWithoutRunningTheLoop) {
   EXPECT_TRUE(observer_.publishedStatus.empty());
   EXPECT_EQ(platform::LiveHandleCount(), handles);
   CloseHandle(squatter);
+}
+
+TEST_F(MonitorLoop, StopAskedForBeforeTheRunEndsItAtOnceAndReachesTheApplication) {
+  skytest::Handle uiStop(CreateEventW(nullptr, FALSE, FALSE, kUiStopEventName));
+  ASSERT_TRUE(uiStop);
+  StopMonitor();  // before RunMonitor created any of its events
+  Run([](const std::vector<Pass>&) { StopMonitor(); });
+  EXPECT_TRUE(observer_.passes.empty()) << "the early stop was lost";
+  EXPECT_EQ(WaitForSingleObject(uiStop.Get(), 0), WAIT_OBJECT_0);
+  // The stop was used up by that run: the next one runs until stopped.
+  observer_.passes.clear();
+  observer_.finished = false;
+  Run([](const std::vector<Pass>& passes) {
+    if (passes.size() == 2) StopMonitor();
+  });
+  EXPECT_EQ(observer_.passes.size(), 2u);
+}
+
+TEST_F(MonitorLoop, PlantedSmallMappingIsReportedOnceAndReplacedWhenFreed) {
+  // Someone created the name first, too small for the block.
+  HANDLE planted =
+      CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0, 4096, kFileMapName);
+  ASSERT_NE(planted, nullptr);
+  debugMode = false;  // events are logged only outside debug mode
+  emu::ClearEventLog();
+  Run([&planted](const std::vector<Pass>& passes) {
+    if (passes.size() == 8) {
+      CloseHandle(planted);
+      planted = nullptr;
+    }
+    if (passes.size() == 16) StopMonitor();
+  });
+  const std::vector<Pass>& passes = observer_.passes;
+  ASSERT_EQ(passes.size(), 16u);
+  EXPECT_EQ(passes[7].sequence, 0u) << "something was published into the small mapping";
+  EXPECT_GT(passes.back().sequence, 0u) << "the service did not take the name back";
+  ASSERT_FALSE(observer_.publishedStatus.empty());
+  EXPECT_EQ(observer_.publishedStatus.back(), 500u);
+  std::size_t reports = 0;
+  for (const emu::EventLogEntry& entry : emu::EventLogEntries()) {
+    for (const std::u16string& text : entry.strings) {
+      if (text.find(u"mapping") != std::u16string::npos) ++reports;
+    }
+  }
+  EXPECT_EQ(reports, 1u);
+}
+
+TEST_F(MonitorLoop, StopDuringAForwardedResumeWithAHungWorkerEndsWith500) {
+  InstallDefaultMachine();
+  Start([](const std::vector<Pass>&) {});
+  ASSERT_TRUE(WaitUntil([this] { return PassCount() >= 1; }));
+  // The loop idles, so that only the rescan meets the device below.
+  Set(&MonitorState::skipTicks, 1000000);
+  // The enclosure's worker reads its identity from the enclosure device at
+  // start; from now on that read never completes.
+  machine_->HangIo("enclosure", sim::Endpoint::Enclosure, true);
+  machine_->ClearCommands();
+  std::thread client([] {
+    HANDLE pipe = OpenCommandPipe(skytest::kGuardMs);
+    if (pipe == INVALID_HANDLE_VALUE) return;
+    auto request = std::make_unique<CommandMessage>();
+    InitCommand(request.get(), kCommandForwardMessage, 0x218, 7);  // resume
+    auto reply = std::make_unique<CommandMessage>();
+    DWORD length = 0;
+    ExchangeCommand(pipe, request.get(), sizeof(CommandMessage), reply.get(),
+                    sizeof(CommandMessage), &length);
+    CloseHandle(pipe);
+  });
+  const bool hung = WaitUntil([this] {
+    for (const sim::Command& c : machine_->Commands("enclosure")) {
+      if (c.endpoint == sim::Endpoint::Enclosure && c.kind == sim::Command::Kind::Scsi &&
+          c.code == 0x12) {
+        return true;
+      }
+    }
+    return false;
+  });
+  StopMonitor();
+  Finish();
+  client.join();
+  ASSERT_TRUE(hung) << "the rescan never reached the enclosure";
+  ASSERT_FALSE(observer_.publishedStatus.empty());
+  EXPECT_EQ(observer_.publishedStatus.back(), 500u) << "a command published after the stop";
+}
+
+TEST_F(MonitorLoop, WorkerRestartWaitsForAQuiesceOnAnotherThread) {
+  InstallDefaultMachine();
+  Start([](const std::vector<Pass>&) {});
+  ASSERT_TRUE(WaitUntil([this] {
+    return PassCount() >= 1 && machine_->PendingCount("firewire", sim::Endpoint::Driver) >= 1;
+  }));
+  // The firewire worker's event wait finishes its cancel only when told, so
+  // the suspend below stops the workers slowly.
+  machine_->SetCancelDelay("firewire", sim::Endpoint::Driver, INFINITE);
+  std::thread suspend([] { HandleForwardedMessage(0x218, 4, 0, nullptr); });
+  ASSERT_TRUE(WaitUntil([] {
+    StateLock lock;
+    return workerState.workerCount == 0;
+  }));
+  Set(&MonitorState::workersRestartRequested, 1);
+  EXPECT_TRUE(WaitUntil([] { return Read(&MonitorState::workersRestartRequested) == 0; }));
+  machine_->FinishHeldCancels();
+  machine_->SetCancelDelay("firewire", sim::Endpoint::Driver, 0);
+  suspend.join();
+  // The restart ran after the quiesce: every started slot holds a live thread.
+  ASSERT_TRUE(WaitUntil([] {
+    StateLock lock;
+    return workerState.workerCount > 0;
+  }));
+  {
+    StateLock lock;
+    for (DWORD i = 0; i < workerState.workerCount; ++i) {
+      EXPECT_NE(workerState.workerThreads[i], INVALID_HANDLE_VALUE) << i;
+      EXPECT_NE(workerState.workerThreads[i], nullptr) << i;
+    }
+    EXPECT_EQ(workerState.workerHandleCount, workerState.workerCount);
+  }
+  StopMonitor();
+  Finish();
+  // Handles and threads of every worker are gone: checked by the leak check.
+}
+
+TEST_F(MonitorLoop, RescanWhileWorkersRunStopsThemFirst) {
+  // A forwarded resume may start workers before the start-up rescan runs.
+  InstallDefaultMachine();
+  Start([](const std::vector<Pass>&) {});
+  ASSERT_TRUE(WaitUntil([] {
+    StateLock lock;
+    return monitorState.rescanCount >= 1 && workerState.workerCount > 0;
+  }));
+  RescanDrives();
+  StopMonitor();
+  Finish();
+  // Every channel handle of the first workers was closed: the leak check.
+}
+
+TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
+  InstallDefaultMachine();
+  // The firewire drive answers a status that keeps it out of the published
+  // list; its record keeps the index 0 of another drive's copy.
+  const std::uint8_t notPublishable[4] = {0x4A, 0x00, 0x00, 0x00};
+  machine_->SetStatus("firewire", notPublishable);
+  struct Seen {
+    LONG publishedCount = 0;
+    std::vector<DWORD> copyCode;
+    std::vector<DWORD> ownCode;
+  };
+  std::vector<Seen> seen;
+  Run([&seen](const std::vector<Pass>& passes) {
+    Seen now;
+    {
+      StateLock lock;
+      const StateBlock* block = monitorState.stateBlock;
+      now.publishedCount = block->publishedCount;
+      for (LONG p = 0; p < block->publishedCount; ++p) {
+        now.copyCode.push_back(block->published[p].statusCode);
+        now.ownCode.push_back(block->drives[block->published[p].recordIndex].statusCode);
+      }
+    }
+    seen.push_back(now);
+    if (passes.size() == 12) StopMonitor();
+  });
+  ASSERT_EQ(seen.size(), 12u);
+  ASSERT_GE(seen.back().publishedCount, 1);
+  for (std::size_t i = 0; i < seen.size(); ++i) {
+    EXPECT_EQ(seen[i].copyCode, seen[i].ownCode) << "pass " << i;
+    for (DWORD code : seen[i].copyCode) EXPECT_NE(code, 4u) << "pass " << i;
+  }
 }
 
 }  // namespace

@@ -69,6 +69,20 @@ TEST_F(Rescan, ForwardedDeviceChangeIsClassifiedWithoutItsRecord) {
   EXPECT_EQ(monitorState.refreshRequests, 1u);
 }
 
+TEST_F(Rescan, RemovalCheckCutShortByAStopSendsNoDriveGone) {
+  // The enumeration aborted by the stop finds no drive; that is no removal.
+  HANDLE stop = CreateEventW(nullptr, TRUE, TRUE, nullptr);
+  ASSERT_NE(stop, nullptr);
+  monitorState.stopEvent = stop;
+  ChannelRecord& channel = monitorState.stateBlock->channels[0];
+  channel.mode = kChannelModeGauge;
+  EXPECT_EQ(CheckRemovedDrives(), 0);
+  EXPECT_EQ(channel.driveGoneSent, 0u);
+  EXPECT_EQ(monitorState.skipTicks, 0u);
+  monitorState.stopEvent = nullptr;
+  CloseHandle(stop);
+}
+
 TEST_F(Rescan, StopWorkersWithNoneRunningOnlySets102) {
   EXPECT_EQ(StopWorkers(), 0u);
   EXPECT_EQ(monitorState.stateBlock->statusWord, 102u);

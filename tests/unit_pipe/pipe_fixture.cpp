@@ -5,6 +5,13 @@
 
 #include "pipe/pipe_server.h"
 
+// The client's quality-of-service flags are the system's own values (the
+// emulation has no impersonation, so the values are checked where the system
+// headers define them).
+#if defined(SECURITY_SQOS_PRESENT)
+static_assert(kPipeClientSecurityFlags == (SECURITY_SQOS_PRESENT | SECURITY_IDENTIFICATION));
+#endif
+
 namespace pipetest {
 
 void MonitorFixture::SetUp() {

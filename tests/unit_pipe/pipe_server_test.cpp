@@ -15,6 +15,9 @@
 #include "pipe/pipe_instance.h"
 #include "pipe_fixture.h"
 #include "platform/wide.h"
+#ifndef _WIN32
+#include "platform/posix/emu_scm.h"
+#endif
 #include "support/test_support.h"
 
 namespace {
@@ -228,9 +231,25 @@ TEST_F(PipeServerTest, StopEventEndsTheThreadWithClientsConnected) {
   if (after != INVALID_HANDLE_VALUE) CloseHandle(after);
 }
 
+TEST_F(PipeServerTest, StopEndsTheThreadWhileSomeoneElseHoldsTheMutex) {
+  // Any account may open the mutex and keep it; a request then waits for it.
+  Handle client = Connect();
+  ASSERT_TRUE(client);
+  ASSERT_EQ(WaitForSingleObject(monitorState.stateMutex, skytest::kGuardMs), WAIT_OBJECT_0);
+  auto request = NewCommand(kCommandSetStatus, 9);
+  DWORD written = 0;
+  ASSERT_TRUE(WriteFile(client.Get(), request.get(), sizeof(CommandMessage), &written, nullptr));
+  // Lets the server reach its wait for the mutex; the outcome does not depend
+  // on it, only whether the case meets that wait.
+  Sleep(50);
+  EXPECT_TRUE(StopServer());
+  ReleaseMutex(monitorState.stateMutex);
+  EXPECT_NE(Published()->statusWord, 9u) << "the request ran after the stop";
+}
+
 class PipeNameTakenTest : public pipetest::MonitorFixture {};
 
-TEST_F(PipeNameTakenTest, ServerRunsWithoutChannelWhenTheNameIsHeld) {
+TEST_F(PipeNameTakenTest, ServerLogsAHeldNameAndServesOnceItIsFree) {
   SKIP_ON_WINE("Wine 8 ignores FILE_FLAG_FIRST_PIPE_INSTANCE and creates the second instance");
   // Someone else created the pipe first (spare instances allowed, so only the
   // first-instance flag can keep the service from joining it).
@@ -238,9 +257,32 @@ TEST_F(PipeNameTakenTest, ServerRunsWithoutChannelWhenTheNameIsHeld) {
                                    PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT,
                                    PIPE_UNLIMITED_INSTANCES, 4096, 4096, 0, nullptr));
   ASSERT_TRUE(squatter) << GetLastError();
-  // The server gives up at once with exit code 0; the stop event is not set.
+#ifndef _WIN32
+  emu::ClearEventLog();
+#endif
   Handle thread(CreateThread(nullptr, 0, PipeServerThread, nullptr, 0, nullptr));
   ASSERT_TRUE(thread);
+  // The server neither joins the other pipe nor gives up: once the name is
+  // free it creates its instances and serves.
+  EXPECT_EQ(WaitForSingleObject(thread.Get(), 100), static_cast<DWORD>(WAIT_TIMEOUT));
+  squatter.Reset();
+  Handle client;
+  for (int attempt = 0; attempt < 100 && !client; ++attempt) {
+    client.Reset(OpenCommandPipe(skytest::kGuardMs));
+    if (!client) Sleep(100);
+  }
+  ASSERT_TRUE(client);
+  EXPECT_EQ(Send(client.Get(), *NewCommand(kCommandSetStatus, 42)).Result(), 1u);
+#ifndef _WIN32
+  std::size_t reports = 0;
+  for (const emu::EventLogEntry& entry : emu::EventLogEntries()) {
+    for (const std::u16string& text : entry.strings) {
+      if (text.find(u"pipe") != std::u16string::npos) ++reports;
+    }
+  }
+  EXPECT_EQ(reports, 1u) << "a held name is logged once";
+#endif
+  SetEvent(monitorState.pipeStopEvent);
   ASSERT_EQ(WaitForSingleObject(thread.Get(), skytest::kGuardMs), WAIT_OBJECT_0);
   DWORD code = 1;
   EXPECT_TRUE(GetExitCodeThread(thread.Get(), &code));

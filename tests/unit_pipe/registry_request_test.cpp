@@ -128,9 +128,9 @@ TEST_F(RegistryRequestTest, RootKeyMustBePredefined) {
   const std::uint64_t refused[] = {
       0,
       RootKeyValue(own),
-      hklm + 2,            // performance data
-      hklm + 4,            // not a root of this system
-      hklm & 0xFFFFFFFFu,  // the 32-bit value without its sign
+      hklm + 2,                           // performance data
+      hklm + 4,                           // not a root of this system
+      (hklm & 0xFFFFFFFFu) | 1ull << 32,  // a high half neither sign nor zero
       0xFFFFFFFFFFFFFFFFull,
   };
   const std::vector<BYTE> data = Pattern(4);
@@ -143,13 +143,22 @@ TEST_F(RegistryRequestTest, RootKeyMustBePredefined) {
   RegCloseKey(own);
   EXPECT_FALSE(key_.HasValue(WSTR("Refused")));
 
+  // Each root as a 64-bit client sends it and in the zero-extended 32-bit
+  // form a 32-bit client sends.
   for (HKEY root : {HKEY_CLASSES_ROOT, HKEY_CURRENT_USER, HKEY_LOCAL_MACHINE, HKEY_USERS,
                     HKEY_CURRENT_CONFIG}) {
-    auto request = NewCommand(kCommandRegistry);
-    ASSERT_TRUE(LayOutRegistryRequest(request.get(), RootKeyValue(root), WSTR(""), WSTR(""), 2,
-                                      REG_NONE, nullptr, 0));
-    EXPECT_EQ(Run(request.get()), ERROR_SUCCESS) << RootKeyValue(root);
+    for (std::uint64_t value : {RootKeyValue(root), RootKeyValue(root) & 0xFFFFFFFFu}) {
+      auto request = NewCommand(kCommandRegistry);
+      ASSERT_TRUE(
+          LayOutRegistryRequest(request.get(), value, WSTR(""), WSTR(""), 2, REG_NONE, nullptr, 0));
+      EXPECT_EQ(Run(request.get()), ERROR_SUCCESS) << std::hex << value;
+    }
   }
+  // The 32-bit form reaches the same key as the 64-bit one.
+  auto set = Request("Narrow", kRegistrySet, REG_BINARY, data.data(), 4);
+  set->registry.rootKey = RootKeyValue(HKEY_CURRENT_USER) & 0xFFFFFFFFu;
+  EXPECT_EQ(Run(set.get()), ERROR_SUCCESS);
+  EXPECT_TRUE(key_.HasValue(WSTR("Narrow")));
 }
 
 // Offsets and lengths against the bytes delivered: each case is laid out in a

@@ -41,6 +41,8 @@ class ServiceLifecycle : public ::testing::Test {
     emu::BeginServiceSession();
     emu::ClearEventLog();
     monitorHooks.afterPass = CountRescans;
+    std::lock_guard<std::mutex> guard(probe.lock);
+    probe.rescans = 0;
   }
   void TearDown() override {
     if (entry_.joinable()) {
@@ -105,8 +107,15 @@ TEST_F(ServiceLifecycle, NullEighthRegistrationRemovesTheSevenAndSkipsTheMonitor
   StartService();
   JoinEntry();
   const std::vector<SERVICE_STATUS> reports = emu::ServiceStatusReports();
-  const std::vector<DWORD> expected = {SERVICE_START_PENDING, SERVICE_STOPPED};
+  // Notifications are registered once the monitor's state exists, so the
+  // monitor's own start report comes first; it never runs a pass.
+  const std::vector<DWORD> expected = {SERVICE_START_PENDING, SERVICE_START_PENDING,
+                                       SERVICE_STOPPED};
   EXPECT_EQ(States(reports), expected);
+  {
+    std::lock_guard<std::mutex> guard(probe.lock);
+    EXPECT_EQ(probe.rescans, 0u);
+  }
   EXPECT_EQ(emu::LiveDeviceNotificationCount(), 0u);
   EXPECT_EQ(notificationTable.count, 0);
   for (HDEVNOTIFY handle : notificationTable.handles) EXPECT_EQ(handle, nullptr);
