@@ -28,6 +28,6 @@ mkdir -p "build/host-fuzz/corpus-$target"
 # The registry store is read and written on every registry call: keep it in
 # memory.
 export SKYVANE_NAMESPACE="${target}fuzz-$$" SKYVANE_REGISTRY="/dev/shm/${target}fuzz-$$-registry"
-trap 'rm -f /dev/shm/"$SKYVANE_NAMESPACE" /dev/shm/"$SKYVANE_NAMESPACE".* "$SKYVANE_REGISTRY"*' EXIT
+trap 'rm -f "$SKYVANE_REGISTRY"*' EXIT
 "build/host-fuzz/tests/fuzz/${target}_fuzzer" -max_total_time="$seconds" -print_final_stats=1 \
   "${options[@]}" "$@" "build/host-fuzz/corpus-$target" "$seeds"

@@ -22,7 +22,6 @@ cmake --preset "$PRESET" >/dev/null
 nice -n 5 cmake --build --preset "$PRESET" -j2 --target stress >/dev/null
 export SKYVANE_TIME_SCALE=${SKYVANE_TIME_SCALE:-0.01}
 export SKYVANE_NAMESPACE="stress-$$"
-trap 'rm -f /dev/shm/"$SKYVANE_NAMESPACE" /dev/shm/"$SKYVANE_NAMESPACE".*' EXIT
 export TSAN_OPTIONS="${TSAN_OPTIONS:-} halt_on_error=1 exitcode=66"
 # shellcheck disable=SC2086
 "build/$PRESET/tests/stress/stress" --cycles "$CYCLES" $EXTRA "$@"

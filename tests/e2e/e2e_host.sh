@@ -14,7 +14,6 @@ cleanup() {
   [ -n "$SVC_PID" ] && kill -9 "$SVC_PID" 2>/dev/null
   [ -n "$HOLDER_PID" ] && kill -9 "$HOLDER_PID" 2>/dev/null
   rm -rf "$WORK"
-  rm -f /dev/shm/"$SKYVANE_NAMESPACE" /dev/shm/"$SKYVANE_NAMESPACE".*
 }
 trap cleanup EXIT
 fail() {

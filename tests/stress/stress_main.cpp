@@ -352,8 +352,6 @@ int main(int argc, char** argv) {
   CloseHandle(mapping);
   machine->WaitForDeviceEvents();
   machine->Uninstall();
-  const std::string region = std::string("/dev/shm/") + std::getenv("SKYVANE_NAMESPACE");
-  unlink(region.c_str());
 
   std::printf(
       "stress: %d cycles in %ld s, %ld exchanges; stops over %d ms: %d (hung until cancels "
