@@ -285,7 +285,7 @@ void TearDown(const MonitorSession* session, bool started) {
   CloseIfOpen(&m.uiStopEvent);
   CloseIfOpen(&m.stopEvent);
   CloseIfOpen(&m.stateMutex);
-  CloseIfOpen(&m.fileMapping);
+  CloseStateMapping();
   std::free(m.stateBlock);
   m.stateBlock = nullptr;
 }

@@ -46,6 +46,7 @@ struct MonitorState {
   HANDLE pipeThread;
 
   StateBlock* stateBlock;  // the working copy; null outside RunMonitor
+  void* mappingView;       // the writable view of fileMapping, kept from its creation
 
   // Observation counters, written under the mutex: loop passes begun,
   // regular ticks completed, rescans completed, copies into the mapping.
@@ -72,11 +73,14 @@ extern MonitorHooks monitorHooks;
 // Copies the working copy into the mapping when publishNeeded is set or force
 // is true, incrementing sequence first; the row references of every drive
 // record in the copy are zero. A null mapping is the service's own named
-// mapping, which is opened again while it is too small to hold the block.
+// mapping, written through the view it keeps; it is opened again while it is
+// too small to hold the block.
 void PublishStateBlock(HANDLE mapping, bool force);
 // Creates or opens the named mapping; logs an event when an existing one is
 // too small to hold the block.
 HANDLE OpenStateMapping(SECURITY_ATTRIBUTES* attributes);
+// Unmaps the kept view and closes the service's own mapping.
+void CloseStateMapping();
 // Rebuilds published and publishedCount from drives (mutex held).
 void BuildPublishedList(StateBlock* block);
 // Marks a full rescan as wanted (burst, gauge and sleep passes with it).

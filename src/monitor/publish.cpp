@@ -43,16 +43,36 @@ HANDLE CreateStateMapping(SECURITY_ATTRIBUTES* attributes) {
 // The service's own mapping could not be mapped whole: lets go of it and
 // opens the name again, which gives a new mapping of the right size once the
 // other owners of a planted one have closed it (mutex held).
-void* RemapOwnMapping() {
+void RemapOwnMapping() {
   NullDaclSecurity security;
-  if (!InitNullDaclSecurity(&security)) return nullptr;
+  if (!InitNullDaclSecurity(&security)) return;
   if (monitorState.fileMapping != nullptr) CloseHandle(monitorState.fileMapping);
   monitorState.fileMapping = CreateStateMapping(&security.attributes);
-  if (monitorState.fileMapping == nullptr) return nullptr;
-  return MapViewOfFile(monitorState.fileMapping, FILE_MAP_WRITE, 0, 0, kStateBlockSize);
+  if (monitorState.fileMapping == nullptr) return;
+  monitorState.mappingView =
+      MapViewOfFile(monitorState.fileMapping, FILE_MAP_WRITE, 0, 0, kStateBlockSize);
+}
+
+// The view of the service's own mapping, mapped once and kept, so that a
+// publish is one copy and its pages stay in place (mutex held). Null when the
+// mapping cannot hold the block; the next publish tries again.
+void* OwnView() {
+  if (monitorState.mappingView == nullptr && monitorState.fileMapping != nullptr) {
+    monitorState.mappingView =
+        MapViewOfFile(monitorState.fileMapping, FILE_MAP_WRITE, 0, 0, kStateBlockSize);
+  }
+  if (monitorState.mappingView == nullptr) RemapOwnMapping();
+  return monitorState.mappingView;
 }
 
 }  // namespace
+
+void CloseStateMapping() {
+  if (monitorState.mappingView != nullptr) UnmapViewOfFile(monitorState.mappingView);
+  monitorState.mappingView = nullptr;
+  if (monitorState.fileMapping != nullptr) CloseHandle(monitorState.fileMapping);
+  monitorState.fileMapping = nullptr;
+}
 
 HANDLE OpenStateMapping(SECURITY_ATTRIBUTES* attributes) {
   const HANDLE mapping = CreateStateMapping(attributes);
@@ -66,18 +86,14 @@ void PublishStateBlock(HANDLE mapping, bool force) {
   if (block == nullptr || (monitorState.publishNeeded == 0 && !force)) return;
   monitorState.publishNeeded = 0;
   const bool own = mapping == nullptr;
-  void* view = MapViewOfFile(own ? monitorState.fileMapping : mapping, FILE_MAP_WRITE, 0, 0,
-                             kStateBlockSize);
-  if (view == nullptr && own) {
-    view = RemapOwnMapping();
-    if (view == nullptr) ReportSmallMapping();
-  }
+  void* view = own ? OwnView() : MapViewOfFile(mapping, FILE_MAP_WRITE, 0, 0, kStateBlockSize);
+  if (view == nullptr && own) ReportSmallMapping();
   if (view == nullptr) return;  // the next forced publish carries the change
   if (own) monitorState.mappingTooSmall = 0;
   block->sequence += 1;
   std::memcpy(view, block, kStateBlockSize);
   ClearRowReferences(static_cast<StateBlock*>(view));
-  UnmapViewOfFile(view);
+  if (!own) UnmapViewOfFile(view);
   monitorState.publishCount += 1;
   if (monitorHooks.afterPublish != nullptr) monitorHooks.afterPublish(block);
 }

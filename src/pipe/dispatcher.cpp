@@ -125,7 +125,8 @@ DWORD DispatchRequest(BYTE* request, DWORD received, BYTE* reply) {
     if (!LockOrStop()) return 0;  // stopping: the thread ends without replying
     replyLength = static_cast<DWORD>(length);
     bool locked = true;
-    outcome = RunCommand(request, std::min<std::size_t>(received, replyLength), &locked);
+    // A request's parts are bounded by what arrived, whatever length it declares.
+    outcome = RunCommand(request, received, &locked);
     if (!locked) return 0;
     ReleaseMutex(monitorState.stateMutex);
     // The shared block shows the request's effect before the reply leaves.

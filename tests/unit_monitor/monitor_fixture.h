@@ -25,7 +25,7 @@ class MonitorFixture : public ::testing::Test {
     ASSERT_NE(monitorState.fileMapping, nullptr);
   }
   void TearDown() override {
-    CloseHandle(monitorState.fileMapping);
+    CloseStateMapping();
     CloseHandle(monitorState.stateMutex);
     std::free(monitorState.stateBlock);
     monitorState = MonitorState{};

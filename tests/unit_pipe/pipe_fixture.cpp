@@ -29,8 +29,8 @@ void MonitorFixture::SetUp() {
 }
 
 void MonitorFixture::TearDown() {
-  for (HANDLE* handle :
-       {&monitorState.stateMutex, &monitorState.fileMapping, &monitorState.pipeStopEvent}) {
+  CloseStateMapping();
+  for (HANDLE* handle : {&monitorState.stateMutex, &monitorState.pipeStopEvent}) {
     if (*handle != nullptr) CloseHandle(*handle);
     *handle = nullptr;
   }
