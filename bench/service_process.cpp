@@ -17,8 +17,7 @@
 #include <unistd.h>
 
 #include <cstdio>
-#include <fstream>
-#include <sstream>
+#include <cstdlib>
 extern char** environ;
 #endif
 
@@ -100,28 +99,39 @@ bool ServiceProcess::Start(const std::string& path) {
   return true;
 }
 
-double ServiceProcess::CpuMicros() const {
-  std::ifstream stat("/proc/" + std::to_string(id_) + "/stat");
-  std::string text((std::istreambuf_iterator<char>(stat)), std::istreambuf_iterator<char>());
-  std::size_t close = text.rfind(')');
-  if (close == std::string::npos) return -1;
-  std::istringstream fields(text.substr(close + 2));
-  std::string field;
-  double ticks = 0;
-  for (int index = 3; fields >> field; ++index) {
-    if (index == 14 || index == 15) ticks += std::stod(field);
-    if (index == 15) break;
+// The text of /proc/<pid>/<name> (empty when it cannot be read).
+std::string ProcText(std::intptr_t pid, const char* name) {
+  std::string path = "/proc/" + std::to_string(pid) + "/" + name;
+  std::string text;
+  if (FILE* file = std::fopen(path.c_str(), "re")) {
+    char buffer[4096];
+    std::size_t got;
+    while ((got = std::fread(buffer, 1, sizeof(buffer), file)) > 0) text.append(buffer, got);
+    std::fclose(file);
   }
-  return ticks * 1e6 / static_cast<double>(sysconf(_SC_CLK_TCK));
+  return text;
+}
+
+double ServiceProcess::CpuMicros() const {
+  const std::string text = ProcText(id_, "stat");
+  const std::size_t close = text.rfind(')');
+  if (close == std::string::npos) return -1;
+  // Fields 14 and 15 (user and system time in clock ticks), counted from the
+  // state field, which is field 3.
+  unsigned long long user = 0;
+  unsigned long long system = 0;
+  if (std::sscanf(text.c_str() + close + 2,
+                  "%*c %*d %*d %*d %*d %*d %*u %*u %*u %*u %*u %llu %llu", &user, &system) != 2) {
+    return -1;
+  }
+  return static_cast<double>(user + system) * 1e6 / static_cast<double>(sysconf(_SC_CLK_TCK));
 }
 
 double ServiceProcess::ResidentKiB() const {
-  std::ifstream status("/proc/" + std::to_string(id_) + "/status");
-  std::string line;
-  while (std::getline(status, line)) {
-    if (line.rfind("VmRSS:", 0) == 0) return std::stod(line.substr(6));
-  }
-  return -1;
+  const std::string text = ProcText(id_, "status");
+  const std::size_t at = text.find("VmRSS:");
+  if (at == std::string::npos) return -1;
+  return std::strtod(text.c_str() + at + 6, nullptr);
 }
 
 void ServiceProcess::Stop() {

@@ -184,8 +184,10 @@ emu::IoStart HidControl(const Target& t, DWORD code, const void* input, DWORD in
   if (code == emu::kHidIoctlGetInputReport) {
     if (input == nullptr || inputLength == 0) return Done(ERROR_INVALID_USER_BUFFER);
     const std::uint8_t id = *static_cast<const std::uint8_t*>(input);
+    // A collection without input reports has none to give.
+    if (spec.hidInputReportLength == 0) return Done(ERROR_INVALID_FUNCTION);
     std::vector<std::uint8_t> report(spec.hidInputReportLength, 0);
-    report[0] = id;
+    report.front() = id;
     if (id == 2 && report.size() >= 5) {
       report[1] = spec.status[3];
       report[2] = spec.status[2];

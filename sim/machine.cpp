@@ -261,8 +261,9 @@ void Machine::Press(const std::string& drive, std::uint8_t eventBits) {
       case ChannelKind::Hid: {
         // The HID class driver gives every open handle its own copy of each
         // input report (up to 32 kept per handle).
+        if (d->spec.hidInputReportLength == 0) break;  // no input reports to carry it
         std::vector<std::uint8_t> report(d->spec.hidInputReportLength, 0);
-        report[0] = 0x01;
+        report.front() = 0x01;
         if (report.size() > 1) report[1] = eventBits;
         for (SimFile* f : s.files) {
           if (f->drive != d->index || f->endpoint != Endpoint::Hid || f->gone) continue;

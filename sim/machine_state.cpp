@@ -71,13 +71,22 @@ std::string HashPart(int index, int salt) {
 
 // A DEV_BROADCAST_DEVICEINTERFACE_W record for one interface.
 std::vector<std::uint8_t> InterfaceRecord(const Interface& iface) {
-  std::vector<std::uint8_t> record(28 + (iface.eventName.size() + 1) * 2, 0);
-  const DWORD size = static_cast<DWORD>(record.size());
+  const std::size_t nameBytes = (iface.eventName.size() + 1) * 2;
+  const DWORD size = static_cast<DWORD>(28 + nameBytes);
   const DWORD type = 5;  // DBT_DEVTYP_DEVICEINTERFACE
-  std::memcpy(&record[0], &size, 4);
-  std::memcpy(&record[4], &type, 4);
-  std::memcpy(&record[12], &iface.interfaceClass, 16);
-  std::memcpy(&record[28], iface.eventName.c_str(), (iface.eventName.size() + 1) * 2);
+  const DWORD reserved = 0;
+  std::vector<std::uint8_t> record;
+  record.reserve(size);
+  auto append = [&record](const void* data, std::size_t length) {
+    for (std::size_t i = 0; i < length; ++i) {
+      record.push_back(static_cast<const std::uint8_t*>(data)[i]);
+    }
+  };
+  append(&size, 4);
+  append(&type, 4);
+  append(&reserved, 4);
+  append(&iface.interfaceClass, 16);
+  append(iface.eventName.c_str(), nameBytes);
   return record;
 }
 

@@ -8,8 +8,7 @@
 #include <climits>
 #include <cstdlib>
 #include <cstring>
-#include <fstream>
-#include <iterator>
+#include <cstdio>
 #include <mutex>
 #include <string>
 #include <vector>
@@ -60,8 +59,13 @@ void AppendProgramName(WideString& line, const WideString& name) {
 }
 
 WideString BuildCommandLine() {
-  std::ifstream file("/proc/self/cmdline", std::ios::binary);
-  std::string raw((std::istreambuf_iterator<char>(file)), std::istreambuf_iterator<char>());
+  std::string raw;
+  if (FILE* file = std::fopen("/proc/self/cmdline", "rbe")) {
+    char buffer[4096];
+    std::size_t got;
+    while ((got = std::fread(buffer, 1, sizeof(buffer), file)) > 0) raw.append(buffer, got);
+    std::fclose(file);
+  }
   std::vector<std::string> arguments;
   std::size_t start = 0;
   while (start < raw.size()) {
