@@ -39,6 +39,12 @@ bool WriteJson(const char* path, const std::vector<bench::Figure>& figures) {
 }  // namespace
 
 int main(int argc, char** argv) {
+#if defined(SKYVANE_BENCH_RESCAN)
+  if (argc == 2 && std::strcmp(argv[1], "--rescan-child") == 0) return bench::RunRescanChild(false);
+  if (argc == 2 && std::strcmp(argv[1], "--rescan-child-quick") == 0) {
+    return bench::RunRescanChild(true);
+  }
+#endif
   bench::Options options;
   const char* json = nullptr;
   for (int i = 1; i < argc; ++i) {
@@ -56,6 +62,10 @@ int main(int argc, char** argv) {
   std::vector<bench::Figure> figures;
   const double floor = bench::MeasureFloor(options, figures);
   bench::MeasureWakeLatency(options, figures);
+  bench::MeasurePublish(options, floor, figures);
+#if defined(SKYVANE_BENCH_RESCAN)
+  bench::MeasureRescan(options, argv[0], figures);
+#endif
   bool ok = options.service.empty() || bench::MeasureService(options, floor, figures);
   PrintTable(figures);
   if (json != nullptr && !WriteJson(json, figures)) {

@@ -48,6 +48,14 @@ double MeasureFloor(const Options& options, std::vector<Figure>& figures);
 // ratios to `floor`. False when the service did not answer.
 bool MeasureCommands(const Options& options, double floor, std::vector<Figure>& figures);
 
+// One forced publish of the block through the kept view.
+void MeasurePublish(const Options& options, double floor, std::vector<Figure>& figures);
+
+// A full rescan of a simulated machine with 63 drives, measured in a child
+// process (`self` is this program) at time scale 0.001 (host build only).
+void MeasureRescan(const Options& options, const char* self, std::vector<Figure>& figures);
+int RunRescanChild(bool quick);
+
 // Starts the service, waits for it to be ready, takes the command figures,
 // its idle CPU and its resident memory, and stops it. False on failure.
 bool MeasureService(const Options& options, double floor, std::vector<Figure>& figures);
