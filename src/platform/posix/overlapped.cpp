@@ -1,6 +1,10 @@
 // Overlapped status bookkeeping, GetOverlappedResult, cancellation and the
 // dispatch of ReadFile / WriteFile / DeviceIoControl to the handle's object.
-#include <condition_variable>
+#include <linux/futex.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <climits>
 #include <mutex>
 
 #include "platform/posix/file_object.h"
@@ -10,12 +14,23 @@ namespace emu {
 namespace {
 
 // Guards every write and read of OVERLAPPED status words made by the
-// emulation, and wakes GetOverlappedResult calls that wait without an event.
+// emulation; `completions` counts stored results, and GetOverlappedResult
+// calls that wait without an event sleep on it (a private futex word).
 // Never destroyed: completions may run while the process exits.
 struct IoState {
   std::mutex lock;
-  std::condition_variable completed;
+  std::uint32_t completions = 0;
 };
+
+void WakeCompletionWaiters(IoState& state) {
+  __atomic_add_fetch(&state.completions, 1, __ATOMIC_SEQ_CST);
+  syscall(SYS_futex, &state.completions, FUTEX_WAKE_PRIVATE, INT_MAX, nullptr, nullptr, 0);
+}
+
+// Sleeps until a result is stored after `seen` was read (or a signal comes).
+void WaitForCompletion(IoState& state, std::uint32_t seen) {
+  syscall(SYS_futex, &state.completions, FUTEX_WAIT_PRIVATE, seen, nullptr, nullptr, 0);
+}
 
 IoState& State() {
   static IoState* state = new IoState();
@@ -107,7 +122,7 @@ void StoreOverlapped(OVERLAPPED* overlapped, DWORD error, DWORD bytes) {
       overlapped->InternalHigh = bytes;
     }
   }
-  state.completed.notify_all();
+  WakeCompletionWaiters(state);
 }
 
 void SignalEventLocked(const std::shared_ptr<SlotObject>& event) {
@@ -210,8 +225,14 @@ BOOL GetOverlappedResult(HANDLE file, LPOVERLAPPED overlapped, LPDWORD numberOfB
         WaitForSingleObject(reinterpret_cast<HANDLE>(event), INFINITE) == WAIT_FAILED) {
       return FALSE;
     }
-    std::unique_lock<std::mutex> guard(state.lock);
-    state.completed.wait(guard, [&] { return overlapped->Internal != STATUS_PENDING; });
+    for (;;) {
+      const std::uint32_t seen = __atomic_load_n(&state.completions, __ATOMIC_SEQ_CST);
+      {
+        std::lock_guard<std::mutex> guard(state.lock);
+        if (overlapped->Internal != STATUS_PENDING) break;
+      }
+      emu::WaitForCompletion(state, seen);
+    }
   }
   ULONG_PTR status;
   ULONG_PTR bytes;
