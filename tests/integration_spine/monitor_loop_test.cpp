@@ -467,6 +467,8 @@ TEST_F(MonitorLoop, RescanWhileWorkersRunStopsThemFirst) {
   // A forwarded resume may start workers before the start-up rescan runs.
   InstallDefaultMachine();
   Start([](const std::vector<Pass>&) {});
+  // A first pass means the state was set up (and the start-up rescan ran).
+  ASSERT_TRUE(WaitUntil([this] { return PassCount() >= 1; }));
   ASSERT_TRUE(WaitUntil([] {
     StateLock lock;
     return monitorState.rescanCount >= 1 && workerState.workerCount > 0;
