@@ -435,6 +435,11 @@ TEST(PipeSecurityTest, NetworkDeniedBeforeVersionSixRemoteFlagFromSix) {
         EXPECT_EQ(entry->Mask, static_cast<ACCESS_MASK>(GENERIC_ALL)) << i;
         EXPECT_TRUE(EqualSid(&entry->SidStart, expected[i].sid)) << i;
       }
+      // The ACL has room for exactly those two.
+      LPVOID beyond = nullptr;
+      EXPECT_FALSE(GetAce(dacl, 2, &beyond));
+      EXPECT_FALSE(AddAccessAllowedAce(dacl, ACL_REVISION, GENERIC_READ, everyone));
+      EXPECT_EQ(GetLastError(), static_cast<DWORD>(ERROR_ALLOTTED_SPACE_EXCEEDED));
     }
     Handle server(
         CreateNamedPipeW(name, PIPE_ACCESS_DUPLEX,
