@@ -22,5 +22,5 @@ struct PipeInstance {
   DWORD replyLength;          // set by the dispatcher
   DWORD state;                // PipeState
   DWORD pending;              // an overlapped operation is in progress
-  NullDaclSecurity security;  // for the instance's pipe and event
+  NullDaclSecurity security;  // for the instance's event
 };

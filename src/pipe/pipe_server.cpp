@@ -32,13 +32,6 @@ Retry retries[kPipeInstanceCount];
 bool failureLogged;  // an event reports instances that are not open
 int scanStart;       // the wait list starts with this instance; rotates
 
-DWORD PipeMode() {
-  // Remote clients are refused where the system knows the flag (major
-  // version 6 and later); the pipe is meant for the local application only.
-  const DWORD major = GetVersion() & 0xFF;
-  return kPipeMode | (major >= 6 ? PIPE_REJECT_REMOTE_CLIENTS : 0);
-}
-
 bool AnyPipeOpen() {
   for (const PipeInstance& instance : instances) {
     if (instance.pipe != nullptr) return true;
@@ -109,8 +102,13 @@ bool OpenInstance(int index) {
   // While none of ours exists the instance must be the first of the name:
   // if another process holds it, the creation fails instead of joining it.
   const DWORD openMode = kPipeOpenMode | (AnyPipeOpen() ? 0 : FILE_FLAG_FIRST_PIPE_INSTANCE);
-  HANDLE pipe = CreateNamedPipeW(kPipeName, openMode, PipeMode(), kPipeMaxInstances, kPipeReadSize,
-                                 kPipeReadSize, kPipeDefaultTimeout, &instance.security.attributes);
+  // Only local clients may reach the pipe: how that is said depends on the
+  // system version (see PipeSecurity). The system copies the descriptor.
+  PipeSecurity security;
+  if (!InitPipeSecurity(&security, GetVersion() & 0xFF)) return false;
+  HANDLE pipe =
+      CreateNamedPipeW(kPipeName, openMode, kPipeMode | security.pipeModeFlags, kPipeMaxInstances,
+                       kPipeReadSize, kPipeReadSize, kPipeDefaultTimeout, &security.attributes);
   if (pipe == INVALID_HANDLE_VALUE) return false;
   instance.pipe = pipe;
   return ConnectInstance(instance);

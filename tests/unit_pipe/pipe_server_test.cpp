@@ -10,12 +10,15 @@
 #include <string>
 #include <vector>
 
+#include "monitor/null_dacl.h"
 #include "pipe/command_message.h"
 #include "pipe/pipe_client.h"
 #include "pipe/pipe_instance.h"
 #include "pipe_fixture.h"
 #include "platform/wide.h"
-#ifndef _WIN32
+#ifdef _WIN32
+#include <aclapi.h>
+#else
 #include "platform/posix/emu_scm.h"
 #endif
 #include "support/test_support.h"
@@ -387,6 +390,88 @@ TEST_F(PipeServerTest, RegistryThroughThePipeReportsNeededSize) {
   EXPECT_EQ(refused.Result(), static_cast<DWORD>(ERROR_INVALID_PARAMETER));
   EXPECT_EQ(refused.reply.size(), sizeof(CommandMessage));
   EXPECT_FALSE(testKey.HasValue(WSTR("CutName")));
+}
+
+// Before major version 6 the pipe's DACL denies the network logon SID, then
+// allows everyone, in that order; from 6 on it is null and the mode refuses
+// remote clients. Either way a pipe created with it serves a local client.
+TEST(PipeSecurityTest, NetworkDeniedBeforeVersionSixRemoteFlagFromSix) {
+  PSID network = nullptr;
+  PSID everyone = nullptr;
+  SID_IDENTIFIER_AUTHORITY nt = SECURITY_NT_AUTHORITY;
+  SID_IDENTIFIER_AUTHORITY world = SECURITY_WORLD_SID_AUTHORITY;
+  ASSERT_TRUE(
+      AllocateAndInitializeSid(&nt, 1, SECURITY_NETWORK_RID, 0, 0, 0, 0, 0, 0, 0, &network));
+  ASSERT_TRUE(
+      AllocateAndInitializeSid(&world, 1, SECURITY_WORLD_RID, 0, 0, 0, 0, 0, 0, 0, &everyone));
+  const struct {
+    BYTE type;
+    PSID sid;
+  } expected[] = {{ACCESS_DENIED_ACE_TYPE, network}, {ACCESS_ALLOWED_ACE_TYPE, everyone}};
+  const WCHAR* name = WSTR("\\\\.\\pipe\\SkyvanePipeSecurityTest");
+  for (DWORD major : {4u, 5u, 6u, 10u}) {
+    SCOPED_TRACE(major);
+    PipeSecurity security;
+    ASSERT_TRUE(InitPipeSecurity(&security, major));
+    BOOL present = FALSE;
+    BOOL defaulted = TRUE;
+    PACL dacl = nullptr;
+    ASSERT_TRUE(GetSecurityDescriptorDacl(security.attributes.lpSecurityDescriptor, &present, &dacl,
+                                          &defaulted));
+    EXPECT_TRUE(present);
+    EXPECT_FALSE(defaulted);
+    if (major >= 6) {
+      EXPECT_EQ(dacl, nullptr);
+      EXPECT_EQ(security.pipeModeFlags, static_cast<DWORD>(PIPE_REJECT_REMOTE_CLIENTS));
+    } else {
+      EXPECT_EQ(security.pipeModeFlags, 0u);
+      ASSERT_NE(dacl, nullptr);
+      ASSERT_EQ(dacl->AceCount, 2u);
+      for (DWORD i = 0; i < 2; ++i) {
+        LPVOID ace = nullptr;
+        ASSERT_TRUE(GetAce(dacl, i, &ace));
+        auto* entry = static_cast<ACCESS_ALLOWED_ACE*>(ace);
+        EXPECT_EQ(entry->Header.AceType, expected[i].type) << i;
+        EXPECT_EQ(entry->Mask, static_cast<ACCESS_MASK>(GENERIC_ALL)) << i;
+        EXPECT_TRUE(EqualSid(&entry->SidStart, expected[i].sid)) << i;
+      }
+      // The ACL has room for exactly those two.
+      LPVOID beyond = nullptr;
+      EXPECT_FALSE(GetAce(dacl, 2, &beyond));
+      EXPECT_FALSE(AddAccessAllowedAce(dacl, ACL_REVISION, GENERIC_READ, everyone));
+      EXPECT_EQ(GetLastError(), static_cast<DWORD>(ERROR_ALLOTTED_SPACE_EXCEEDED));
+    }
+    Handle server(
+        CreateNamedPipeW(name, PIPE_ACCESS_DUPLEX,
+                         PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | security.pipeModeFlags, 1, 64,
+                         64, 0, &security.attributes));
+    ASSERT_TRUE(server) << GetLastError();
+#ifdef _WIN32
+    // The system keeps the ACEs on the pipe in the same order.
+    PACL applied = nullptr;
+    PSECURITY_DESCRIPTOR descriptor = nullptr;
+    ASSERT_EQ(GetSecurityInfo(server.Get(), SE_KERNEL_OBJECT, DACL_SECURITY_INFORMATION, nullptr,
+                              nullptr, &applied, nullptr, &descriptor),
+              static_cast<DWORD>(ERROR_SUCCESS));
+    if (major < 6) {
+      ASSERT_NE(applied, nullptr);
+      ASSERT_EQ(applied->AceCount, 2u);
+      for (DWORD i = 0; i < 2; ++i) {
+        LPVOID ace = nullptr;
+        ASSERT_TRUE(GetAce(applied, i, &ace));
+        auto* entry = static_cast<ACCESS_ALLOWED_ACE*>(ace);
+        EXPECT_EQ(entry->Header.AceType, expected[i].type) << i;
+        EXPECT_TRUE(EqualSid(&entry->SidStart, expected[i].sid)) << i;
+      }
+    }
+    LocalFree(descriptor);
+#endif
+    Handle client(
+        CreateFileW(name, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr));
+    EXPECT_TRUE(client) << GetLastError();
+  }
+  FreeSid(network);
+  FreeSid(everyone);
 }
 
 }  // namespace

@@ -336,3 +336,59 @@ constexpr DWORD ERROR_SEM_TIMEOUT = 121;
 constexpr DWORD ERROR_UNKNOWN_REVISION = 1305;
 constexpr DWORD ERROR_MAPPED_ALIGNMENT = 1132;
 constexpr DWORD ERROR_NOT_ENOUGH_QUOTA = 1816;
+
+// ---- SIDs and access control lists (built and read back; not enforced) -----
+constexpr DWORD ERROR_REVISION_MISMATCH = 1306;
+constexpr DWORD ERROR_INVALID_ACL = 1336;
+constexpr DWORD ERROR_INVALID_SID = 1337;
+constexpr DWORD ERROR_ALLOTTED_SPACE_EXCEEDED = 1344;
+using ACCESS_MASK = DWORD;
+using PSID = void*;
+struct SID_IDENTIFIER_AUTHORITY {
+  BYTE Value[6];
+};
+using PSID_IDENTIFIER_AUTHORITY = SID_IDENTIFIER_AUTHORITY*;
+struct SID {
+  BYTE Revision;
+  BYTE SubAuthorityCount;
+  SID_IDENTIFIER_AUTHORITY IdentifierAuthority;
+  DWORD SubAuthority[1];
+};
+constexpr BYTE SID_REVISION = 1;
+constexpr BYTE SID_MAX_SUB_AUTHORITIES = 15;
+#define SECURITY_WORLD_SID_AUTHORITY {0, 0, 0, 0, 0, 1}
+#define SECURITY_NT_AUTHORITY {0, 0, 0, 0, 0, 5}
+constexpr DWORD SECURITY_WORLD_RID = 0;
+constexpr DWORD SECURITY_NETWORK_RID = 2;
+constexpr DWORD ACL_REVISION = 2;
+constexpr DWORD ACL_REVISION_DS = 4;
+constexpr BYTE ACCESS_ALLOWED_ACE_TYPE = 0;
+constexpr BYTE ACCESS_DENIED_ACE_TYPE = 1;
+struct ACE_HEADER {
+  BYTE AceType;
+  BYTE AceFlags;
+  WORD AceSize;
+};
+struct ACCESS_ALLOWED_ACE {
+  ACE_HEADER Header;
+  ACCESS_MASK Mask;
+  DWORD SidStart;
+};
+struct ACCESS_DENIED_ACE {
+  ACE_HEADER Header;
+  ACCESS_MASK Mask;
+  DWORD SidStart;
+};
+BOOL AllocateAndInitializeSid(PSID_IDENTIFIER_AUTHORITY authority, BYTE subAuthorityCount,
+                              DWORD sub0, DWORD sub1, DWORD sub2, DWORD sub3, DWORD sub4,
+                              DWORD sub5, DWORD sub6, DWORD sub7, PSID* sid);
+PVOID FreeSid(PSID sid);
+BOOL IsValidSid(PSID sid);
+DWORD GetLengthSid(PSID sid);
+BOOL EqualSid(PSID sid1, PSID sid2);
+BOOL InitializeAcl(PACL acl, DWORD length, DWORD revision);
+BOOL AddAccessAllowedAce(PACL acl, DWORD revision, DWORD accessMask, PSID sid);
+BOOL AddAccessDeniedAce(PACL acl, DWORD revision, DWORD accessMask, PSID sid);
+BOOL GetAce(PACL acl, DWORD index, LPVOID* ace);
+BOOL GetSecurityDescriptorDacl(PSECURITY_DESCRIPTOR descriptor, LPBOOL daclPresent, PACL* dacl,
+                               LPBOOL daclDefaulted);
