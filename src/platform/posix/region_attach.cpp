@@ -28,7 +28,7 @@ namespace emu::kernel {
 namespace {
 
 constexpr std::uint64_t kMagic = 0x314C4E524B56534BULL;  // "KSVKRNL1"
-constexpr std::uint32_t kVersion = 5;
+constexpr std::uint32_t kVersion = 6;
 constexpr std::uint64_t kFileBytes = kArenaOffset + kArenaBytes;
 
 [[noreturn]] void Die(const char* what) {
