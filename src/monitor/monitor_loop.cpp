@@ -15,6 +15,7 @@
 #include "pipe/pipe_server.h"
 #include "service/service_main.h"
 #include "transport/drive_features.h"
+#include "transport/io_block.h"
 #include "transport/status_pages.h"
 
 namespace {
@@ -281,6 +282,9 @@ void TearDown(const MonitorSession* session, bool started) {
       channel.readyEvent = nullptr;
     }
   }
+  // With the workers gone, requests set aside that have completed since are
+  // freed; one still pending stays to the end of the process.
+  FreeSetAsideIoBlocks();
   CloseIfOpen(&m.workerStopEvent);
   CloseIfOpen(&m.uiStopEvent);
   CloseIfOpen(&m.stopEvent);
