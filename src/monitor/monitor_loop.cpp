@@ -98,7 +98,7 @@ void SleepStatePass(StateBlock* block) {
     DriveRecord& drive = block->drives[i];
     if (drive.extendedIdentity == 0) continue;
     BYTE page[5];
-    drive.powerState = ReadSleepState(&drive, page);
+    drive.powerState = ReadSleepState(&drive, page, m.stopEvent);
     if (drive.powerState != 0 && drive.powerState != 3) m.sleepRepeat = 1;
   }
 }
@@ -127,7 +127,7 @@ void StatusPass(StateBlock* block) {
     if (drive.extendedIdentity == 0) continue;
     const LONG p = drive.publishedIndex;
     BYTE page[8] = {};
-    const DWORD code = ReadDriveStatus(&drive, page);
+    const DWORD code = ReadDriveStatus(&drive, page, m.stopEvent);
     const LONG level = page[0] == 0x82 ? (page[4] >> 6) & 0x03 : -1;
     drive.statusCode = code;
     drive.statusLevel = level;

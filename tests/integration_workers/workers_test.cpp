@@ -5,6 +5,8 @@
 // since the block is freed when the monitor ends.
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <chrono>
 #include <condition_variable>
 #include <functional>
 #include <memory>
@@ -391,6 +393,49 @@ TEST_F(WorkersTest, DriveGoneFromAnotherThreadLeavesTheHandleToItsWorker) {
   EXPECT_EQ(step, 1);
   EXPECT_EQ(snapshots_.back().endedWorkers, 1u) << "only the lights worker ended on its own";
   EXPECT_EQ(machine_->OpenCount("lights", sim::Endpoint::Driver), 0u);
+}
+
+TEST_F(WorkersTest, AStatusReadThatTheEnclosureNeverAnswersEndsOnItsTimeOutOrAStop) {
+  // The enclosure stops answering while the monitor reads its status page
+  // with the mutex held. The read is given up after the device time-out, so
+  // the passes go on; and a stop ends a read at once.
+  Install(DefaultMachine());
+  std::atomic<bool> monitorEnded{false};
+  std::atomic<int> passesAfterAsk{-1};
+  std::thread stopper;
+  Run([&](const std::vector<Snapshot>& passes) {
+    if (passesAfterAsk >= 0) passesAfterAsk += 1;
+    if (stopper.joinable() || passes.back().rescans < 1) return false;
+    machine_->HangIo("enclosure", sim::Endpoint::Enclosure, true);
+    machine_->ClearCommands();
+    stopper = std::thread([&] {
+      // Two status reads (page 0x82) asked for: the first was given up, and
+      // the stop comes while the second is pending.
+      std::size_t asked = 0;
+      for (int i = 0; i < 4000 && asked < 2; ++i) {
+        asked = 0;
+        for (const sim::Command& c : machine_->Commands("enclosure")) {
+          asked += c.code == 0x1C && c.cdb.size() > 2 && c.cdb[2] == 0x82;
+        }
+        if (asked == 1 && passesAfterAsk < 0) passesAfterAsk = 0;
+        if (asked < 2) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+      }
+      EXPECT_EQ(asked, 2u) << "the first read never ended";
+      StopMonitor();
+      // A hang guard only: the stop takes a cancellation grace at most.
+      for (int i = 0; i < 2000 && !monitorEnded; ++i) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+      }
+      if (!monitorEnded) {
+        ADD_FAILURE() << "the stop did not end the status read";
+        machine_->Detach("enclosure");
+      }
+    });
+    return false;
+  });
+  monitorEnded = true;
+  stopper.join();
+  EXPECT_GE(passesAfterAsk, 1) << "no pass ran between the two reads";
 }
 
 }  // namespace
