@@ -140,7 +140,8 @@ DWORD SendDriveGone(ChannelRecord* channel) {
   }
   const DWORD sent = SendDriveCommand(channel, CTL_SET_GAUGE, kDriveGoneGaugeValue, nullptr);
   if (sent != 0 && channel->mode == kChannelModeGauge && channel->kind == kChannelKindDriver) {
-    // Closing the shared handle ends the channel's worker.
+    // Closing the shared handle ends the channel's worker (which closes it
+    // itself when it runs).
     CloseChannelDevice(channel);
   }
   return sent;
