@@ -275,7 +275,7 @@ LONG EnumerateDrives(HANDLE cancelEvent) {
   for (LONG i = 0; i < kMaxDrives; ++i) SetDiskNumberRead(i, false);
 
   InterfaceList list(kDiskInterfaceClass);
-  if (!list.Opened()) return -1;
+  if (!list.Opened()) return kEnumerationFailed;
   LONG result = -1;
   WideString path;
   for (DWORD index = 0;; ++index) {

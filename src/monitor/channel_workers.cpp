@@ -4,6 +4,7 @@
 #include "monitor/monitor_state.h"
 #include "monitor/state_lock.h"
 #include "service/process_locks.h"
+#include "transport/drive_features.h"
 
 WorkerState workerState;
 
@@ -23,6 +24,7 @@ bool StartWorker(int channelIndex, DWORD slot) {
                               FILE_FLAG_OVERLAPPED, nullptr);
   if (device == INVALID_HANDLE_VALUE) return false;
   channel.deviceHandle = device;
+  WithdrawChannelClose(&channel);  // one asked of an earlier worker
   DWORD threadId = 0;
   HANDLE thread = CreateThread(nullptr, 0, storage ? StorageChannelWorker : ControlChannelWorker,
                                &channel, 0, &threadId);

@@ -15,6 +15,7 @@
 #include "pipe/pipe_server.h"
 #include "service/service_main.h"
 #include "transport/drive_features.h"
+#include "transport/io_block.h"
 #include "transport/status_pages.h"
 
 namespace {
@@ -97,7 +98,7 @@ void SleepStatePass(StateBlock* block) {
     DriveRecord& drive = block->drives[i];
     if (drive.extendedIdentity == 0) continue;
     BYTE page[5];
-    drive.powerState = ReadSleepState(&drive, page);
+    drive.powerState = ReadSleepState(&drive, page, m.stopEvent);
     if (drive.powerState != 0 && drive.powerState != 3) m.sleepRepeat = 1;
   }
 }
@@ -126,7 +127,7 @@ void StatusPass(StateBlock* block) {
     if (drive.extendedIdentity == 0) continue;
     const LONG p = drive.publishedIndex;
     BYTE page[8] = {};
-    const DWORD code = ReadDriveStatus(&drive, page);
+    const DWORD code = ReadDriveStatus(&drive, page, m.stopEvent);
     const LONG level = page[0] == 0x82 ? (page[4] >> 6) & 0x03 : -1;
     drive.statusCode = code;
     drive.statusLevel = level;
@@ -281,6 +282,9 @@ void TearDown(const MonitorSession* session, bool started) {
       channel.readyEvent = nullptr;
     }
   }
+  // With the workers gone, requests set aside that have completed since are
+  // freed; one still pending stays to the end of the process.
+  FreeSetAsideIoBlocks();
   CloseIfOpen(&m.workerStopEvent);
   CloseIfOpen(&m.uiStopEvent);
   CloseIfOpen(&m.stopEvent);

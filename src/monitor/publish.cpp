@@ -116,7 +116,7 @@ void BuildPublishedList(StateBlock* block) {
     DriveRecord& drive = block->drives[i];
     if (drive.extendedIdentity == 0) continue;
     BYTE page[8];
-    const DWORD statusCode = ReadDriveStatus(&drive, page);
+    const DWORD statusCode = ReadDriveStatus(&drive, page, monitorState.stopEvent);
     drive.statusCode = statusCode;
     if (page[0] != 0x82) {
       drive.statusLevel = -1;

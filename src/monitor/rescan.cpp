@@ -142,10 +142,12 @@ int CheckRemovedDrives() {
   WaitForSingleObject(monitorState.stopEvent, 2000);
   StateLock lock;
   StateBlock* block = monitorState.stateBlock;
-  EnumerateDrives(monitorState.stopEvent);
+  const LONG listed = EnumerateDrives(monitorState.stopEvent);
   AssignVolumeLetters();
   monitorState.driveListStale = 0;
-  // An enumeration cut short by a stop found nothing: that is no removal.
+  // An enumeration that failed, or was cut short by a stop, found nothing:
+  // that is no removal.
+  if (listed == kEnumerationFailed) return 0;
   if (WaitForSingleObject(monitorState.stopEvent, 0) == WAIT_OBJECT_0) return 0;
   int sent = 0;
   for (int i = 0; i < block->channelCount && i < kMaxChannels; ++i) {

@@ -12,6 +12,7 @@
 #include "platform/wide.h"
 #include "transport/button_events.h"
 #include "transport/drive_command.h"
+#include "transport/drive_features.h"
 #include "transport/pass_through.h"
 #include "volume/safe_removal.h"
 #include "volume/volume_letters.h"
@@ -35,8 +36,13 @@ struct WorkerRun {
   ChannelRecord* channel;
   WorkerKind kind;
   HANDLE stopEvent;
-  bool failed = false;  // ends the event loop and asks for a refresh on exit
+  bool failed = false;   // ends the event loop and asks for a refresh on exit
+  LONG lastLinked = -1;  // the drive the channel was last linked to
 };
+
+void NoteLink(WorkerRun& run) {
+  if (run.channel->linkedDrive >= 0) run.lastLinked = run.channel->linkedDrive;
+}
 
 bool Signalled(HANDLE event) {
   return event != nullptr && WaitForSingleObject(event, 0) == WAIT_OBJECT_0;
@@ -64,6 +70,7 @@ void LinkAfterEvent(WorkerRun& run, DriveRecord* scratch) {
     monitorState.gaugePassRequested = 1;
   }
   channel->firstEventSeen = 1;
+  NoteLink(run);
 }
 
 // Links the channel at start and tells the rescan that the worker is ready.
@@ -74,6 +81,7 @@ void LinkAtStart(WorkerRun& run) {
     run.failed = true;
     Sleep(kLinkFailurePauseMs);
   } else {
+    NoteLink(run);
     monitorState.gaugePassRequested = 1;
     monitorState.sleepPassRequested = 1;
     monitorState.burstRequested = 1;
@@ -108,7 +116,10 @@ void HandleEvent(WorkerRun& run, BYTE event) {
   if ((event & kButtonRemovalRequest) != 0) {
     DriveRecord copy = scratch;
     if (SafeRemoveDrive(&copy, channel) == 0) {
-      block->statusWord = kStatusRemovalFailedBase + static_cast<DWORD>(channel->linkedDrive);
+      // An earlier removal may have unlinked the channel: the drive it was
+      // last linked to is the one named.
+      const LONG drive = channel->linkedDrive >= 0 ? channel->linkedDrive : run.lastLinked;
+      block->statusWord = kStatusRemovalFailedBase + static_cast<DWORD>(drive);
       if (run.kind == WorkerKind::Storage) monitorState.publishNeeded = 1;
     }
     if (run.kind == WorkerKind::Control) {
@@ -127,6 +138,16 @@ HANDLE CurrentDeviceHandle(const ChannelRecord* channel) {
   return channel->deviceHandle;
 }
 
+// Closes the channel's handle when another thread asked for it and has not
+// withdrawn the request meanwhile; true when it was closed.
+bool CloseIfAsked(ChannelRecord* channel) {
+  if (!ChannelCloseRequested(channel)) return false;
+  StateLock lock;
+  if (!WithdrawChannelClose(channel)) return false;
+  CloseChannelDevice(channel);
+  return true;
+}
+
 // Waits for button events and acts on them until the device goes, the link
 // failed or the workers are stopped.
 void EventLoop(WorkerRun& run) {
@@ -134,6 +155,7 @@ void EventLoop(WorkerRun& run) {
   while (!run.failed && CurrentDeviceHandle(run.channel) != nullptr) {
     const BYTE event = ReadButtonEvent(run.channel);
     const DWORD error = GetLastError();
+    if (CloseIfAsked(run.channel)) break;
     if (DeviceGone(error)) {
       run.failed = true;
       break;
@@ -158,11 +180,10 @@ DWORD FinishWorker(WorkerRun& run) {
   if (run.failed) RequestRefresh();
   StateLock lock;
   ChannelRecord* channel = run.channel;
-  if (channel->deviceHandle != nullptr) {
-    CloseHandle(channel->deviceHandle);
-    channel->deviceHandle = nullptr;
-    channel->threadHandle = nullptr;
-  }
+  CloseChannelDevice(channel);
+  // No worker runs on the channel any more: a close asked from now on is
+  // done at once.
+  channel->threadHandle = nullptr;
   return 0;
 }
 
@@ -193,6 +214,7 @@ void InquiryIdentity(ChannelRecord* channel, HANDLE stopEvent) {
 DWORD WINAPI ControlChannelWorker(LPVOID channelRecord) {
   WorkerRun run{static_cast<ChannelRecord*>(channelRecord), WorkerKind::Control,
                 monitorState.workerStopEvent};
+  ClaimChannelDevice(run.channel);
   BYTE start = 0;
   DriveCommand(run.channel, CTL_WORKER_START, &start, 1, run.stopEvent);
   // A driver channel writes nothing for a stated length of 1; a HID channel
@@ -210,6 +232,7 @@ DWORD WINAPI ControlChannelWorker(LPVOID channelRecord) {
 DWORD WINAPI StorageChannelWorker(LPVOID channelRecord) {
   WorkerRun run{static_cast<ChannelRecord*>(channelRecord), WorkerKind::Storage,
                 monitorState.workerStopEvent};
+  ClaimChannelDevice(run.channel);
   if (run.channel->kind == kChannelKindHid) {
     BYTE identity[kIdentityBufferBytes] = {};
     DriveCommand(run.channel, CTL_GET_IDENTITY, identity, sizeof(identity), run.stopEvent);

@@ -8,6 +8,7 @@
 #include "monitor/state_lock.h"
 #include "platform/wide.h"
 #include "transport/drive_command.h"
+#include "transport/drive_features.h"
 #include "transport/io_block.h"
 #include "transport/pass_through.h"
 #include "volume/volume_letters.h"
@@ -106,7 +107,9 @@ BYTE ReadButtonEvent(ChannelRecord* channel) {
       pending = error == ERROR_IO_PENDING;
     }
     while (pending) {
-      if (Signalled(stopEvent)) break;
+      // A stop, or another thread asking for the handle to be closed, gives
+      // the read up; only this thread may close the handle it runs on.
+      if (Signalled(stopEvent) || ChannelCloseRequested(channel)) break;
       const DWORD wait = WaitForSingleObject(block->event, kWaitSliceMs);
       if (wait == WAIT_TIMEOUT) continue;
       if (wait == WAIT_OBJECT_0) {
@@ -137,7 +140,8 @@ BYTE ReadButtonEvent(ChannelRecord* channel) {
       result = static_cast<BYTE>(controlOutput & 0xFF);
     }
   }
-  // A stop (or a failed wait) leaves the read outstanding: it is given up.
+  // A stop, a close request or a failed wait leaves the read outstanding: it
+  // is given up.
   if (block != nullptr) {
     if (pending) {
       AbandonIoBlock(device, block);

@@ -2,6 +2,7 @@
 // the drive-gone command, both carried by the drive command sender.
 #include "transport/drive_features.h"
 
+#include <atomic>
 #include <cstddef>
 #include <cstdint>
 
@@ -38,6 +39,22 @@ bool QueryVolumeSpace(const WCHAR* root, VolumeSpace* space) {
 // ones, and a free count above the total cannot drive the sum past 100 %.)
 bool Usable(const VolumeSpace& space) {
   return space.totalMiB != 0 && space.freeMiB <= space.totalMiB;
+}
+
+// Closes asked of channel workers, by channel index.
+std::atomic<bool> closeRequests[kMaxChannels];
+// The channel whose worker runs on this thread, if any.
+thread_local const ChannelRecord* ownedChannel = nullptr;
+
+// The close-request slot of a record of the working channel array; null for
+// any other record (a copy, or one outside a running monitor).
+std::atomic<bool>* CloseRequestSlot(const ChannelRecord* channel) {
+  const StateBlock* block = monitorState.stateBlock;
+  if (block == nullptr || channel == nullptr || channel->ownIndex < 0 ||
+      channel->ownIndex >= kMaxChannels || &block->channels[channel->ownIndex] != channel) {
+    return nullptr;
+  }
+  return &closeRequests[channel->ownIndex];
 }
 
 // The drive record in the working array that the channel is linked to.
@@ -123,7 +140,8 @@ DWORD SendDriveGone(ChannelRecord* channel) {
   }
   const DWORD sent = SendDriveCommand(channel, CTL_SET_GAUGE, kDriveGoneGaugeValue, nullptr);
   if (sent != 0 && channel->mode == kChannelModeGauge && channel->kind == kChannelKindDriver) {
-    // Closing the shared handle ends the channel's worker.
+    // Closing the shared handle ends the channel's worker (which closes it
+    // itself when it runs).
     CloseChannelDevice(channel);
   }
   return sent;
@@ -131,10 +149,32 @@ DWORD SendDriveGone(ChannelRecord* channel) {
 
 void CloseChannelDevice(ChannelRecord* channel) {
   if (channel == nullptr) return;
+  std::atomic<bool>* request = CloseRequestSlot(channel);
+  if (request != nullptr && channel->threadHandle != nullptr && ownedChannel != channel) {
+    // The worker may be blocked on the handle: closing it here would leave
+    // the worker with a raw value that may soon name another object.
+    if (channel->deviceHandle != nullptr) request->store(true);
+    return;
+  }
+  if (request != nullptr) request->store(false);
   if (channel->deviceHandle != nullptr && channel->deviceHandle != INVALID_HANDLE_VALUE) {
     CloseHandle(channel->deviceHandle);
   }
   channel->deviceHandle = nullptr;
+}
+
+void ClaimChannelDevice(ChannelRecord* channel) {
+  ownedChannel = channel;
+}
+
+bool WithdrawChannelClose(ChannelRecord* channel) {
+  std::atomic<bool>* request = CloseRequestSlot(channel);
+  return request != nullptr && request->exchange(false);
+}
+
+bool ChannelCloseRequested(const ChannelRecord* channel) {
+  const std::atomic<bool>* request = CloseRequestSlot(channel);
+  return request != nullptr && request->load();
 }
 
 DWORD SendDriveGoneFor(DriveRecord* drive, ChannelRecord* channel) {

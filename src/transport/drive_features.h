@@ -24,7 +24,19 @@ void RefreshChannelGauge(int channelIndex, HANDLE abortEvent);
 // 0 when nothing was sent (null record or already sent), else the sender's
 // result. Mutex held.
 DWORD SendDriveGone(ChannelRecord* channel);
-// Closes the channel's shared device handle, if open, and clears the field.
+// The channel's shared device handle belongs to the channel's worker while
+// one runs: only that thread closes it. Called by the worker, or when no
+// worker runs, this closes the handle, if open, and clears the field; from
+// any other thread it asks the worker to close it at its next wait and
+// returns at once. Mutex held.
 void CloseChannelDevice(ChannelRecord* channel);
+// The calling thread is the channel's worker and owns its device handle.
+void ClaimChannelDevice(ChannelRecord* channel);
+// Drops a close asked of the worker (a worker starting afresh, or a removal
+// that failed and keeps the channel); true when one was pending. Mutex held.
+bool WithdrawChannelClose(ChannelRecord* channel);
+// Whether another thread asked the channel's worker to close its handle.
+// Read without the mutex, so that a wait can end on it.
+bool ChannelCloseRequested(const ChannelRecord* channel);
 // channel null: the drive's own channelIndex selects it. Always 1.
 DWORD SendDriveGoneFor(DriveRecord* drive, ChannelRecord* channel);

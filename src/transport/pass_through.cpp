@@ -37,13 +37,20 @@ void FillRequest(PassThroughRequest* request, BYTE cdbLength, BYTE dataIn, DWORD
 }
 
 // Waits for the pending request on the block or the abort event (may be
-// null). After an abort, or a wait that failed, the block is given up
-// (AbandonIoBlock) and must not be touched again.
+// null), at most the device time-out: a request the port driver has not
+// completed by then is hung, and is given up like an aborted one (last error
+// ERROR_SEM_TIMEOUT). After an abort, a time-out or a wait that failed, the
+// block is given up (AbandonIoBlock) and must not be touched again.
 WaitOutcome WaitForRequest(HANDLE device, IoBlock* block, HANDLE abortEvent, DWORD* bytes) {
   *bytes = 0;
   const HANDLE handles[2] = {block->event, abortEvent};
   const DWORD count = abortEvent != nullptr ? 2 : 1;
-  const DWORD wait = WaitForMultipleObjects(count, handles, FALSE, INFINITE);
+  const DWORD wait = WaitForMultipleObjects(count, handles, FALSE, kCommandTimeOutSeconds * 1000);
+  if (wait == WAIT_TIMEOUT) {
+    AbandonIoBlock(device, block);
+    SetLastError(ERROR_SEM_TIMEOUT);
+    return WaitOutcome::WaitFailed;
+  }
   if (wait == WAIT_OBJECT_0) {
     if (GetOverlappedResult(device, &block->overlapped, bytes, TRUE)) return WaitOutcome::Completed;
     *bytes = 0;

@@ -2,7 +2,8 @@
 // generic device I/O control with an abortable overlapped wait. Every
 // operation takes an open handle; none opens or closes devices.
 //
-// Abort: when the abort event is signalled while a request is pending, the
+// Abort: when the abort event is signalled while a request is pending, or
+// the request is still pending after the device time-out (20 s), the
 // handle's I/O is cancelled and 3000 ms are granted for the cancellation.
 // Every request runs on a heap block of its own (OVERLAPPED record, event,
 // request and data buffers; io_block.h), so a device that has not finished
@@ -39,7 +40,8 @@ constexpr BYTE kInquiryLength = 74;
 
 // Issues the control with an own overlapped record and waits for it or for
 // abortEvent (may be null). bytesReturned (may be null) receives the count
-// transferred, 0 after a failure or an abort. An abort sets last error 995.
+// transferred, 0 after a failure or an abort. An abort sets last error 995, a
+// time-out 121.
 bool IoControlWait(HANDLE device, DWORD controlCode, void* input, DWORD inputLength, void* output,
                    DWORD outputLength, DWORD* bytesReturned, HANDLE abortEvent);
 
@@ -56,7 +58,8 @@ DWORD ScsiInquiryPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE length, H
 // event may be null for a handle opened without overlapped I/O); the
 // transfer runs on a record of its own. A transfer that was
 // started but did not complete successfully reports ERROR_IO_PENDING (997);
-// the thread's last error then tells the cause (995 after an abort).
+// the thread's last error then tells the cause (995 after an abort, 121
+// after the time-out).
 DWORD ReceiveDiagnosticPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE length,
                             OVERLAPPED* overlapped, HANDLE abortEvent);
 // buffer holds the whole page, header included.

@@ -66,9 +66,12 @@ OpenedDrive OpenDrive(const DriveRecord* drive) {
     NoteRefreshConditions(drive, kRefreshNoStatusPath, true);
     return opened;
   }
+  // Diagnostic pages go through an overlapped handle, so that their wait can
+  // be given up; HID reports are read and written synchronously.
+  const DWORD flags = opened.transport == Transport::Diagnostic ? FILE_FLAG_OVERLAPPED : 0;
   opened.handle =
       CreateFileW(path, GENERIC_READ | GENERIC_WRITE, FILE_SHARE_READ | FILE_SHARE_WRITE, nullptr,
-                  OPEN_EXISTING, 0, nullptr);
+                  OPEN_EXISTING, flags, nullptr);
   if (opened.handle == INVALID_HANDLE_VALUE) {
     opened.error = FailureCode(GetLastError());
     NoteRefreshConditions(drive, kRefreshOpenFails, true);
@@ -96,7 +99,8 @@ DWORD GetHidInputReport(HANDLE device, BYTE* report, ULONG length) {
 
 // Reads one page, from the diagnostic page or from the HID input report that
 // stands for it. Returns 0 or the error; pauses after a failed read.
-DWORD ReadPage(const DriveRecord* drive, BYTE pageCode, BYTE* page, BYTE pageLength) {
+DWORD ReadPage(const DriveRecord* drive, BYTE pageCode, BYTE* page, BYTE pageLength,
+               HANDLE abortEvent) {
   OpenedDrive opened = OpenDrive(drive);
   if (opened.noStatusInterface) return opened.error;
   DWORD error = opened.error;
@@ -104,7 +108,7 @@ DWORD ReadPage(const DriveRecord* drive, BYTE pageCode, BYTE* page, BYTE pageLen
     if (opened.transport == Transport::Diagnostic) {
       OVERLAPPED overlapped{};
       error =
-          ReceiveDiagnosticPage(opened.handle, pageCode, page, pageLength, &overlapped, nullptr);
+          ReceiveDiagnosticPage(opened.handle, pageCode, page, pageLength, &overlapped, abortEvent);
     } else {
       BYTE report[kInputReportLength] = {};
       report[0] = pageCode == kStatusPage ? kStatusReportId : kSleepReportId;
@@ -122,7 +126,13 @@ DWORD ReadPage(const DriveRecord* drive, BYTE pageCode, BYTE* page, BYTE pageLen
     }
     CloseHandle(opened.handle);
   }
-  if (error != ERROR_SUCCESS) Sleep(kFailedReadPauseMs);
+  if (error != ERROR_SUCCESS) {
+    if (abortEvent != nullptr) {
+      WaitForSingleObject(abortEvent, kFailedReadPauseMs);
+    } else {
+      Sleep(kFailedReadPauseMs);
+    }
+  }
   return error;
 }
 
@@ -133,15 +143,15 @@ DWORD StatusCodeOfPage(const BYTE* page) {
   return kStatusCodes[page[4] & 0x0F];
 }
 
-DWORD ReadDriveStatus(const DriveRecord* drive, BYTE* page) {
+DWORD ReadDriveStatus(const DriveRecord* drive, BYTE* page, HANDLE abortEvent) {
   std::memset(page, 0, kStatusPageLength);
-  if (ReadPage(drive, kStatusPage, page, kStatusPageLength) != ERROR_SUCCESS) return 0;
+  if (ReadPage(drive, kStatusPage, page, kStatusPageLength, abortEvent) != ERROR_SUCCESS) return 0;
   return StatusCodeOfPage(page);
 }
 
-DWORD ReadSleepState(const DriveRecord* drive, BYTE* page) {
+DWORD ReadSleepState(const DriveRecord* drive, BYTE* page, HANDLE abortEvent) {
   std::memset(page, 0, kSleepPageLength);
-  if (ReadPage(drive, kSleepPage, page, kSleepPageLength) != ERROR_SUCCESS) return 3;
+  if (ReadPage(drive, kSleepPage, page, kSleepPageLength, abortEvent) != ERROR_SUCCESS) return 3;
   switch (page[4] >> 6) {
     case 2:
       return 2;

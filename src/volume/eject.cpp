@@ -89,6 +89,8 @@ bool EjectAttempt(HMODULE library, DEVINST node, DWORD capabilities) {
 
 void ReopenChannelDevice(ChannelRecord* channel) {
   if (channel == nullptr) return;
+  // A close only asked of the worker is called off: its handle stays.
+  if (WithdrawChannelClose(channel) || channel->deviceHandle != nullptr) return;
   const HANDLE device = CreateFileW(channel->devicePath, GENERIC_READ | GENERIC_WRITE,
                                     FILE_SHARE_READ | FILE_SHARE_WRITE, nullptr, OPEN_EXISTING,
                                     FILE_FLAG_OVERLAPPED, nullptr);

@@ -16,7 +16,8 @@ constexpr DWORD kEjectNoticePauseMs = 200;
 constexpr BYTE kEjectNoticeValue = 0x20;
 
 // Opens the channel's device again (overlapped) after it was closed for a
-// removal that then failed; the handle stays null when the open fails.
+// removal that then failed; the handle stays null when the open fails. A
+// close that was only asked of the channel's worker is withdrawn instead.
 void ReopenChannelDevice(ChannelRecord* channel);
 
 // 1 when the Plug and Play manager accepted the removal of the drive's node

@@ -46,7 +46,7 @@ int SafeRemoveDrive(DriveRecord* drive, ChannelRecord* channel) {
   // A volume that stays online stops the removal before any eject.
   if (DismountDriveVolumes(drive) == 0 || EjectDriveDevice(drive, channel) == 0) {
     const DWORD error = GetLastError();
-    if (handleClosed && channel->deviceHandle == nullptr) ReopenChannelDevice(channel);
+    if (handleClosed) ReopenChannelDevice(channel);
     SetLastError(error);
     return 0;
   }

@@ -5,6 +5,8 @@
 // since the block is freed when the monitor ends.
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <chrono>
 #include <condition_variable>
 #include <functional>
 #include <memory>
@@ -14,12 +16,14 @@
 #include <vector>
 
 #include "machine.h"
+#include "monitor/channel_workers.h"
 #include "monitor/monitor_state.h"
 #include "monitor/state_lock.h"
 #include "platform/wide.h"
 #include "service/process_locks.h"
 #include "service/service_host.h"
 #include "transport/drive_command.h"
+#include "transport/drive_features.h"
 
 namespace {
 
@@ -36,6 +40,7 @@ struct Snapshot {
   std::vector<DWORD> fromChannel;
   std::vector<DWORD> pendingAction;
   std::vector<DWORD> lightMarker;
+  DWORD endedWorkers = 0;
 };
 
 Snapshot Take(PassKind kind) {
@@ -54,6 +59,9 @@ Snapshot Take(PassKind kind) {
   }
   for (LONG i = 0; i < block->driveCount; ++i)
     s.fromChannel.push_back(block->drives[i].fromChannel);
+  for (DWORD i = 0; i < workerState.workerHandleCount; ++i) {
+    s.endedWorkers += WaitForSingleObject(workerState.workerThreads[i], 0) == WAIT_OBJECT_0;
+  }
   return s;
 }
 
@@ -306,6 +314,128 @@ TEST_F(WorkersTest, EjectButtonRemovesTheDriveAndTheRescanForgetsIt) {
   const Snapshot& last = snapshots_.back();
   EXPECT_EQ(last.channelCount, 1);
   EXPECT_EQ(last.linked, (std::vector<LONG>{0}));
+}
+
+TEST_F(WorkersTest, RemovalFailingAfterTheDriveWentNamesTheDriveTheWorkerLinked) {
+  // Ejecting the gauge drive's disk leaves its HID channel in place, unlinked
+  // (a model that makes no drive record of its own); a second removal
+  // request on it then fails and names drive 0 all the same.
+  std::string text(sim::DefaultMachineText());
+  const std::size_t model = text.find("model-code 7B44");
+  ASSERT_NE(model, std::string::npos);
+  text.replace(model, 15, "model-code 7B43");
+  std::string error;
+  std::unique_ptr<sim::Machine> machine = sim::LoadMachine(text, &error);
+  ASSERT_NE(machine, nullptr) << error;
+  Install(std::move(machine));
+  int step = 0;
+  Run([&](const std::vector<Snapshot>& passes) {
+    const Snapshot& now = passes.back();
+    const bool waiting = machine_->PendingCount("gauge", sim::Endpoint::Hid) >= 1;
+    if (step == 0 && now.rescans >= 1 && waiting) {
+      machine_->Press("gauge", 0x04);
+      step = 1;
+    } else if (step == 1 && !machine_->Ejects().empty() && now.linked[0] == -1 && waiting) {
+      machine_->Press("gauge", 0x04);
+      step = 2;
+    }
+    return step == 2 && now.statusWord >= 599;
+  });
+  const std::vector<sim::Machine::EjectRequest> ejects = machine_->Ejects();
+  ASSERT_EQ(ejects.size(), 1u);
+  EXPECT_FALSE(ejects[0].vetoed);
+  EXPECT_EQ(snapshots_.back().statusWord, 600u);
+}
+
+TEST_F(WorkersTest, DriveGoneFromAnotherThreadLeavesTheHandleToItsWorker) {
+  // A driver channel in gauge mode ends with the drive-gone command. Its
+  // worker is blocked in a read on a device that never completes a cancel:
+  // only the worker can give that read up, so it must be the one to close.
+  std::unique_ptr<sim::Machine> machine = CountedMachine();
+  sim::DriveSpec lights;
+  lights.name = "lights";
+  lights.bus = sim::Bus::Ieee1394;
+  lights.channel = sim::ChannelKind::Driver;
+  lights.modelCode = "5E22";
+  lights.unitModel = "EXTERNAL_LIGHTS";
+  lights.unitId = "0030E0000002C4D5";
+  lights.serial = "QX-02C4D5";
+  sim::VolumeSpec volume;
+  volume.letter = 'J';
+  lights.volumes.push_back(volume);
+  machine->AddDrive(lights);
+  Install(std::move(machine));
+  int step = 0;
+  Run([&](const std::vector<Snapshot>& passes) {
+    if (step == 0) {
+      if (passes.back().rescans < 1 || machine_->PendingCount("lights", sim::Endpoint::Driver) < 1)
+        return false;
+      machine_->SetCancelDelay("lights", sim::Endpoint::Driver, INFINITE);
+      StateLock lock;
+      StateBlock* block = monitorState.stateBlock;
+      for (int i = 0; i < block->channelCount; ++i) {
+        ChannelRecord& channel = block->channels[i];
+        if (WideContains(channel.devicePath, WSTR("external_lights")) &&
+            channel.mode == kChannelModeGauge) {
+          EXPECT_EQ(SendDriveGone(&channel), 1u);
+          step = 1;
+        }
+      }
+      EXPECT_EQ(step, 1) << "no gauge-mode driver channel";
+      return step != 1;
+    }
+    if (passes.back().endedWorkers == 0) return false;
+    // The read the worker gave up completes now; the monitor's teardown
+    // frees what it left behind.
+    machine_->FinishHeldCancels();
+    return true;
+  });
+  EXPECT_EQ(step, 1);
+  EXPECT_EQ(snapshots_.back().endedWorkers, 1u) << "only the lights worker ended on its own";
+  EXPECT_EQ(machine_->OpenCount("lights", sim::Endpoint::Driver), 0u);
+}
+
+TEST_F(WorkersTest, AStatusReadThatTheEnclosureNeverAnswersEndsOnItsTimeOutOrAStop) {
+  // The enclosure stops answering while the monitor reads its status page
+  // with the mutex held. The read is given up after the device time-out, so
+  // the passes go on; and a stop ends a read at once.
+  Install(DefaultMachine());
+  std::atomic<bool> monitorEnded{false};
+  std::atomic<int> passesAfterAsk{-1};
+  std::thread stopper;
+  Run([&](const std::vector<Snapshot>& passes) {
+    if (passesAfterAsk >= 0) passesAfterAsk += 1;
+    if (stopper.joinable() || passes.back().rescans < 1) return false;
+    machine_->HangIo("enclosure", sim::Endpoint::Enclosure, true);
+    machine_->ClearCommands();
+    stopper = std::thread([&] {
+      // Two status reads (page 0x82) asked for: the first was given up, and
+      // the stop comes while the second is pending.
+      std::size_t asked = 0;
+      for (int i = 0; i < 4000 && asked < 2; ++i) {
+        asked = 0;
+        for (const sim::Command& c : machine_->Commands("enclosure")) {
+          asked += c.code == 0x1C && c.cdb.size() > 2 && c.cdb[2] == 0x82;
+        }
+        if (asked == 1 && passesAfterAsk < 0) passesAfterAsk = 0;
+        if (asked < 2) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+      }
+      EXPECT_EQ(asked, 2u) << "the first read never ended";
+      StopMonitor();
+      // A hang guard only: the stop takes a cancellation grace at most.
+      for (int i = 0; i < 2000 && !monitorEnded; ++i) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+      }
+      if (!monitorEnded) {
+        ADD_FAILURE() << "the stop did not end the status read";
+        machine_->Detach("enclosure");
+      }
+    });
+    return false;
+  });
+  monitorEnded = true;
+  stopper.join();
+  EXPECT_GE(passesAfterAsk, 1) << "no pass ran between the two reads";
 }
 
 }  // namespace

@@ -1,6 +1,8 @@
 // The drive-gone command: once per channel record, in the form each channel
 // kind and mode takes, and the end of a driver gauge channel's handle.
 #include "features_fixture.h"
+#include "monitor/rescan.h"
+#include "service/interface_classes.h"
 #include "transport/drive_command.h"
 #include "transport/drive_features.h"
 
@@ -74,6 +76,23 @@ TEST_F(DriveGoneTest, ForDriveFindsTheChannelByIndex) {
   EXPECT_EQ(HidValues("plain").size(), 1u);
   drive.channelIndex = -1;
   EXPECT_EQ(SendDriveGoneFor(&drive, nullptr), 1u);
+}
+
+TEST_F(DriveGoneTest, RemovalCheckSkipsAnEnumerationThatFailed) {
+  // Every channel has had a gauge value; a list of disks that cannot be had
+  // says nothing about which drives went.
+  for (int i = 0; i < Block().channelCount; ++i) Block().channels[i].gaugePercentSent = 50;
+  machine_.FailInterfaceList(kDiskInterfaceClass, ERROR_NOT_ENOUGH_MEMORY);
+  EXPECT_EQ(EnumerateDrives(nullptr), kEnumerationFailed);
+  EXPECT_EQ(CheckRemovedDrives(), 0);
+  for (int i = 0; i < Block().channelCount; ++i) EXPECT_EQ(Block().channels[i].driveGoneSent, 0u);
+
+  // Once the list works again, a drive that is no longer listed gets its
+  // command.
+  machine_.FailInterfaceList(kDiskInterfaceClass, 0);
+  machine_.FailOpen("plain", sim::Endpoint::Disk, ERROR_FILE_NOT_FOUND);
+  EXPECT_EQ(CheckRemovedDrives(), 1);
+  EXPECT_EQ(Plain()->driveGoneSent, 1u);
 }
 
 }  // namespace
