@@ -312,10 +312,12 @@ void RunMonitor(int, LPWSTR*, const MonitorSession* session) {
     // final 500.
     StopPipeServer();
     {
+      // One hold for both: a worker whose removal the stop cut short must
+      // not put its 600 + n between the 500 and its publish.
       StateLock lock;
       m.stateBlock->statusWord = kStatusStopping;
+      PublishStateBlock(nullptr, true);
     }
-    PublishStateBlock(nullptr, true);
   }
   TearDown(session, started);
   monitorStopRequested = false;

@@ -27,6 +27,7 @@
 #include "monitor/monitor_state.h"
 #include "pipe/pipe_client.h"
 #include "platform/diagnostics.h"
+#include "transport/io_block.h"
 #include "service/process_locks.h"
 #include "service/service_host.h"
 
@@ -280,6 +281,10 @@ void RunCycle(const Options& options, sim::Machine* machine, HANDLE mapping, std
     if (!machine->Attached(drive)) machine->Attach(drive);
   }
   machine->WaitForDeviceEvents();
+  // Requests set aside after their cancel grace completed only now that the
+  // cancels were released; the service frees such blocks when it next sees
+  // them, as the run that set them aside has ended, so does the harness.
+  FreeSetAsideIoBlocks();
   if (!CountsSettle(handles, threads)) {
     totals->leaks += 1;
     std::fprintf(stderr, "cycle %d: handles %ld -> %ld, threads %ld -> %ld\n", totals->cycles,
