@@ -444,7 +444,10 @@ void Machine::State::TimerLoop() {
     auto next = std::min_element(timed.begin(), timed.end(),
                                  [](const auto& a, const auto& b) { return a.due < b.due; });
     if (next->due > std::chrono::steady_clock::now()) {
-      timerWake.wait_until(lock, next->due);
+      // A copy: the wait releases the lock, and a completion scheduled
+      // meanwhile may move the vector's elements.
+      const auto due = next->due;
+      timerWake.wait_until(lock, due);
       continue;
     }
     TimedCompletion due = std::move(*next);
