@@ -4,7 +4,7 @@
 # mingw-w64 cross compiler and Wine for the Windows build.
 set -euo pipefail
 
-want=(cmake make g++ googletest libgtest-dev clang libclang-rt-14-dev)
+want=(cmake make g++ googletest libgtest-dev clang libclang-rt-14-dev libcli11-dev nlohmann-json3-dev tmux)
 if [ "${1:-all}" = all ]; then
   want+=(g++-mingw-w64-x86-64-posix wine wine64)
 fi
