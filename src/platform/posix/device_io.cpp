@@ -23,7 +23,8 @@ struct IoRequest {
   std::int32_t thread = 0;
   std::atomic<bool> cancelRequested{false};
   // Guarded by the device I/O lock below.
-  bool completed = false;
+  bool completed = false;  // taken by one completer; the device may not complete it again
+  bool settled = false;    // its OVERLAPPED and event are written: the caller may go on
   DWORD error = ERROR_SUCCESS;
   DWORD bytes = 0;
 };
@@ -120,6 +121,7 @@ class DeviceFileObject : public FileObject, public std::enable_shared_from_this<
       {
         std::lock_guard<std::mutex> guard(Io().lock);
         request->completed = true;
+        request->settled = true;
       }
       Forget(request.get());
       if (asynchronous) return FinishAtOnce(overlapped, event, result.error, result.bytes, done);
@@ -129,12 +131,14 @@ class DeviceFileObject : public FileObject, public std::enable_shared_from_this<
       SetLastError(ERROR_IO_PENDING);
       return FALSE;
     }
-    // A synchronous handle: wait here until the device completes it.
+    // A synchronous handle: wait here until the device completes it and its
+    // OVERLAPPED, if one was given, is written (the caller may free it as
+    // soon as the call returns).
     DWORD error;
     DWORD bytes;
     {
       std::unique_lock<std::mutex> guard(Io().lock);
-      Io().completed.wait(guard, [&] { return request->completed; });
+      Io().completed.wait(guard, [&] { return request->settled; });
       error = request->error;
       bytes = request->bytes;
     }
@@ -176,10 +180,14 @@ void CompleteIo(const IoRequestPtr& request, DWORD error, DWORD bytes) {
     request->error = error;
     request->bytes = bytes;
   }
-  Io().completed.notify_all();
   if (auto owner = request->owner.lock()) owner->Forget(request.get());
   StoreOverlapped(request->overlapped, error, bytes);
   SignalEvent(request->event);
+  {
+    std::lock_guard<std::mutex> guard(Io().lock);
+    request->settled = true;
+  }
+  Io().completed.notify_all();
 }
 
 void* IoOutputBuffer(const IoRequestPtr& request) {
