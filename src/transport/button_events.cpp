@@ -19,7 +19,8 @@ constexpr BYTE kEventPage = 0x80;
 constexpr BYTE kEventPageLength = 5;
 constexpr DWORD kHidEventReportLength = 64;
 constexpr DWORD kEnclosurePollPauseMs = 250;
-constexpr DWORD kWaitSliceMs = 100;
+// A close request is a flag, not an object: the wait looks at it this often.
+constexpr DWORD kCloseRequestPollMs = 1000;
 constexpr DWORD kSerialBufferBytes = 512;
 constexpr std::size_t kIdentityUnits = 128;
 
@@ -109,9 +110,13 @@ BYTE ReadButtonEvent(ChannelRecord* channel) {
     while (pending) {
       // A stop, or another thread asking for the handle to be closed, gives
       // the read up; only this thread may close the handle it runs on.
+      // The wait ends on the read or on the stop itself, so an idle worker
+      // sleeps instead of waking to look at the stop event.
       if (Signalled(stopEvent) || ChannelCloseRequested(channel)) break;
-      const DWORD wait = WaitForSingleObject(block->event, kWaitSliceMs);
-      if (wait == WAIT_TIMEOUT) continue;
+      const HANDLE waits[2] = {block->event, stopEvent};
+      const DWORD wait =
+          WaitForMultipleObjects(stopEvent != nullptr ? 2 : 1, waits, FALSE, kCloseRequestPollMs);
+      if (wait == WAIT_TIMEOUT || wait == WAIT_OBJECT_0 + 1) continue;
       if (wait == WAIT_OBJECT_0) {
         // The byte comes from the buffer whatever the outcome; the outcome
         // only tells the caller whether the device is still there.
