@@ -143,11 +143,11 @@ DWORD RefreshGaugesRequest(DWORD letterArg, DWORD forceResend) {
 DWORD ReadStatusRequest(const BYTE* driveImage, BYTE* statusBlock) {
   const int found = FindDriveByKey(driveImage);
   if (found < 0) return ERROR_INVALID_PARAMETER;
-  return ReadDriveStatus(&Block().drives[found], statusBlock);
+  return ReadDriveStatus(&Block().drives[found], statusBlock, monitorState.pipeStopEvent);
 }
 
 DWORD WriteControlRequest(const BYTE* driveImage, const BYTE* controlBlock) {
   const int found = FindDriveByKey(driveImage);
   if (found < 0) return ERROR_INVALID_PARAMETER;
-  return WriteDriveControl(&Block().drives[found], controlBlock);
+  return WriteDriveControl(&Block().drives[found], controlBlock, monitorState.pipeStopEvent);
 }

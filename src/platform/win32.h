@@ -17,6 +17,7 @@
 #include <windows.h>
 #include <winioctl.h>
 #include <ntddscsi.h>
+#include <hidclass.h>
 #include <setupapi.h>
 #include <cfgmgr32.h>
 extern "C" {

@@ -72,18 +72,10 @@ WaitOutcome WaitForRequest(HANDLE device, IoBlock* block, HANDLE abortEvent, DWO
 bool IssueAndWait(HANDLE device, DWORD code, IoBlock* block, void* input, DWORD inputLength,
                   void* output, DWORD outputLength, HANDLE abortEvent, DWORD* bytes, bool* pending,
                   bool* given) {
-  *pending = false;
-  *given = false;
-  *bytes = 0;
-  if (DeviceIoControl(device, code, input, inputLength, output, outputLength, bytes,
-                      &block->overlapped)) {
-    return true;
-  }
-  if (GetLastError() != ERROR_IO_PENDING) return false;
-  *pending = true;
-  const WaitOutcome outcome = WaitForRequest(device, block, abortEvent, bytes);
-  *given = outcome == WaitOutcome::Aborted || outcome == WaitOutcome::WaitFailed;
-  return outcome == WaitOutcome::Completed;
+  const BOOL started = DeviceIoControl(device, code, input, inputLength, output, outputLength,
+                                       bytes, &block->overlapped);
+  *pending = !started && GetLastError() == ERROR_IO_PENDING;
+  return FinishBlockRequest(device, started, block, abortEvent, bytes, given);
 }
 
 // The SCSI request and its data, side by side in one heap block.
@@ -165,6 +157,19 @@ DWORD NoMemory() {
 }
 
 }  // namespace
+
+bool FinishBlockRequest(HANDLE device, BOOL started, IoBlock* block, HANDLE abortEvent,
+                        DWORD* bytes, bool* given) {
+  *given = false;
+  if (started) return true;
+  if (GetLastError() != ERROR_IO_PENDING) {
+    *bytes = 0;
+    return false;
+  }
+  const WaitOutcome outcome = WaitForRequest(device, block, abortEvent, bytes);
+  *given = outcome == WaitOutcome::Aborted || outcome == WaitOutcome::WaitFailed;
+  return outcome == WaitOutcome::Completed;
+}
 
 bool IoControlWait(HANDLE device, DWORD controlCode, void* input, DWORD inputLength, void* output,
                    DWORD outputLength, DWORD* bytesReturned, HANDLE abortEvent) {

@@ -15,6 +15,7 @@
 #include <cstddef>
 
 #include "platform/win32.h"
+#include "transport/io_block.h"
 
 // The block handed to IOCTL_SCSI_PASS_THROUGH_DIRECT as both the input and
 // the output buffer: the platform's structure, the block length and the
@@ -37,6 +38,15 @@ constexpr DWORD kCancelGraceMs = 3000;
 // CONDITION), as result and as the thread's last error.
 constexpr DWORD kScsiStatusErrorBase = 0x20000000;
 constexpr BYTE kInquiryLength = 74;
+
+// Finishes a request started on the block's overlapped record (`started` is
+// what the starting call returned; its last error is still the thread's):
+// waits for it or for abortEvent (may be null), at most the device time-out.
+// True when it completed successfully. *given tells that the block was given
+// up (after an abort, a time-out or a failed wait): the caller must not touch
+// it then, and frees it otherwise.
+bool FinishBlockRequest(HANDLE device, BOOL started, IoBlock* block, HANDLE abortEvent,
+                        DWORD* bytes, bool* given);
 
 // Issues the control with an own overlapped record and waits for it or for
 // abortEvent (may be null). bytesReturned (may be null) receives the count

@@ -6,6 +6,7 @@
 
 #include "monitor/monitor_state.h"
 #include "platform/wide.h"
+#include "transport/io_block.h"
 #include "transport/pass_through.h"
 #include "transport/refresh_on_change.h"
 
@@ -66,9 +67,9 @@ OpenedDrive OpenDrive(const DriveRecord* drive) {
     NoteRefreshConditions(drive, kRefreshNoStatusPath, true);
     return opened;
   }
-  // Diagnostic pages go through an overlapped handle, so that their wait can
-  // be given up; HID reports are read and written synchronously.
-  const DWORD flags = opened.transport == Transport::Diagnostic ? FILE_FLAG_OVERLAPPED : 0;
+  // Both paths use an overlapped handle, so that a wait for a device that
+  // does not answer can be given up.
+  const DWORD flags = FILE_FLAG_OVERLAPPED;
   opened.handle =
       CreateFileW(path, GENERIC_READ | GENERIC_WRITE, FILE_SHARE_READ | FILE_SHARE_WRITE, nullptr,
                   OPEN_EXISTING, flags, nullptr);
@@ -82,18 +83,27 @@ OpenedDrive OpenDrive(const DriveRecord* drive) {
   return opened;
 }
 
-// HidD_GetInputReport, looked up in "hid.dll" at each call. 0 or the error.
-DWORD GetHidInputReport(HANDLE device, BYTE* report, ULONG length) {
-  const HMODULE library = LoadLibraryW(WSTR("hid.dll"));
-  if (library == nullptr) return FailureCode(GetLastError());
-  using GetInputReportFunction = BOOLEAN(WINAPI*)(HANDLE, PVOID, ULONG);
-  const auto function = reinterpret_cast<GetInputReportFunction>(
-      reinterpret_cast<void (*)()>(GetProcAddress(library, "HidD_GetInputReport")));
-  DWORD error = ERROR_SUCCESS;
-  if (function == nullptr || !function(device, report, length)) {
-    error = FailureCode(GetLastError());
+// Runs one HID transfer on a heap block: the input report named by data[0]
+// (read into data) or the output report in data (written). Waits at most the
+// device time-out, and gives up on abortEvent (may be null). 0 or the error.
+DWORD HidTransfer(HANDLE device, bool read, BYTE* data, DWORD length, HANDLE abortEvent) {
+  IoBlock* block = NewIoBlock(length);
+  if (block == nullptr) return FailureCode(GetLastError());
+  std::memcpy(block->Data(), data, length);
+  DWORD bytes = 0;
+  // The input report is asked for as HidD_GetInputReport asks for it, with
+  // the report number in the buffer's first byte.
+  const BOOL started =
+      read ? DeviceIoControl(device, IOCTL_HID_GET_INPUT_REPORT, block->Data(), length,
+                             block->Data(), length, &bytes, &block->overlapped)
+           : WriteFile(device, block->Data(), length, &bytes, &block->overlapped);
+  bool given = false;
+  const bool ok = FinishBlockRequest(device, started, block, abortEvent, &bytes, &given);
+  const DWORD error = ok ? ERROR_SUCCESS : FailureCode(GetLastError());
+  if (!given) {
+    if (ok && read) std::memcpy(data, block->Data(), length);
+    FreeIoBlock(block);
   }
-  FreeLibrary(library);
   return error;
 }
 
@@ -112,7 +122,7 @@ DWORD ReadPage(const DriveRecord* drive, BYTE pageCode, BYTE* page, BYTE pageLen
     } else {
       BYTE report[kInputReportLength] = {};
       report[0] = pageCode == kStatusPage ? kStatusReportId : kSleepReportId;
-      error = GetHidInputReport(opened.handle, report, kInputReportLength);
+      error = HidTransfer(opened.handle, true, report, kInputReportLength, abortEvent);
       if (error == ERROR_SUCCESS && pageCode == kStatusPage) {
         page[0] = kStatusPage;
         page[4] = static_cast<BYTE>(report[4] & 0xCF);
@@ -162,19 +172,16 @@ DWORD ReadSleepState(const DriveRecord* drive, BYTE* page, HANDLE abortEvent) {
   }
 }
 
-DWORD WriteDriveControl(const DriveRecord* drive, const BYTE* control) {
+DWORD WriteDriveControl(const DriveRecord* drive, const BYTE* control, HANDLE abortEvent) {
   OpenedDrive opened = OpenDrive(drive);
   if (opened.handle == INVALID_HANDLE_VALUE) return kNotOpened;
   DWORD result;
   if (opened.transport == Transport::Diagnostic) {
     OVERLAPPED overlapped{};
-    result = SendDiagnosticPage(opened.handle, control, kStatusPageLength, &overlapped, nullptr);
+    result = SendDiagnosticPage(opened.handle, control, kStatusPageLength, &overlapped, abortEvent);
   } else {
-    const BYTE report[5] = {kControlReportId, control[7], control[6], 0x00, control[4]};
-    DWORD written = 0;
-    result = WriteFile(opened.handle, report, sizeof(report), &written, nullptr)
-                 ? ERROR_SUCCESS
-                 : FailureCode(GetLastError());
+    BYTE report[5] = {kControlReportId, control[7], control[6], 0x00, control[4]};
+    result = HidTransfer(opened.handle, false, report, sizeof(report), abortEvent);
   }
   CloseHandle(opened.handle);
   return result;

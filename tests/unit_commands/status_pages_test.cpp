@@ -2,6 +2,9 @@
 // control interface (diagnostic pages) and its HID collection (reports).
 #include "transport/status_pages.h"
 
+#include <chrono>
+#include <future>
+
 #include "commands_fixture.h"
 
 namespace cmdtest {
@@ -116,17 +119,27 @@ TEST_F(StatusPagesTest, ControlBlockIsWrittenOnEitherPath) {
   EXPECT_EQ(WriteDriveControl(&hid, control), static_cast<DWORD>(ERROR_GEN_FAILURE));
 }
 
-TEST_F(StatusPagesTest, MissingInputReportExportFailsEveryHidRead) {
-  machine_.RemoveExport("hid.dll", "HidD_GetInputReport");
+// A USB drive whose HID collection never answers: every read and write is
+// given up on the caller's stop event instead of holding it (and the mutex
+// it holds) for good.
+TEST_F(StatusPagesTest, HungHidCollectionIsGivenUpOnTheStopEvent) {
   const DriveRecord drive = HidDrive();
-  SetStatus(machine_, "gauge", {0x45, 0, 0, 0});
-  BYTE status[8];
-  BYTE sleep[5];
-  EXPECT_EQ(ReadDriveStatus(&drive, status), 0u);
-  EXPECT_EQ(ReadSleepState(&drive, sleep), 3u);
-  EXPECT_EQ(status[0], 0x00);
-  EXPECT_TRUE(Sent("gauge", Kind::HidInputReport).empty());
-  EXPECT_EQ(monitorState.refreshRequests, 0u);
+  machine_.HangIo("gauge", sim::Endpoint::Hid, true);
+  const HANDLE stop = CreateEventW(nullptr, TRUE, TRUE, nullptr);
+  const BYTE control[8] = {0x82, 0x00, 0x00, 0x00, 0x07, 0x00, 0xAA, 0xBB};
+  auto calls = std::async(std::launch::async, [&] {
+    BYTE status[8];
+    BYTE sleep[5];
+    return std::vector<DWORD>{ReadDriveStatus(&drive, status, stop),
+                              ReadSleepState(&drive, sleep, stop),
+                              WriteDriveControl(&drive, control, stop)};
+  });
+  const bool ended = calls.wait_for(std::chrono::seconds(60)) == std::future_status::ready;
+  machine_.HangIo("gauge", sim::Endpoint::Hid, false);
+  ASSERT_TRUE(ended) << "a hung HID collection held the caller";
+  EXPECT_EQ(calls.get(), (std::vector<DWORD>{0, 3, static_cast<DWORD>(ERROR_OPERATION_ABORTED)}));
+  EXPECT_EQ(Sent("gauge", Kind::HidInputReport).size(), 2u);
+  CloseHandle(stop);
 }
 
 TEST_F(StatusPagesTest, DriveThatDoesNotOpenAsksForARescan) {
