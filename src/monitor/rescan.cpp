@@ -22,19 +22,6 @@ constexpr ULONG_PTR kPowerResumeCritical = 6;
 constexpr ULONG_PTR kPowerResumeSuspend = 7;
 constexpr ULONG_PTR kPowerResumeAutomatic = 0x12;
 
-// Holds the rescan lock for a scope (the lock is recursive).
-class RescanGuard {
- public:
-  RescanGuard() { EnterCriticalSection(&rescanLock); }
-  ~RescanGuard() { LeaveCriticalSection(&rescanLock); }
-  RescanGuard(const RescanGuard&) = delete;
-  RescanGuard& operator=(const RescanGuard&) = delete;
-};
-
-}  // namespace
-
-namespace {
-
 // Waits until every ready event has been signalled once, or the service
 // stops; false on a stop. The events are auto-reset, so each one is waited
 // for until it comes and then left out; the list never holds more than the
@@ -61,7 +48,7 @@ bool WaitForReadyEvents(HANDLE* events, DWORD count) {
 }  // namespace
 
 void RescanDrives() {
-  RescanGuard guard;
+  SectionLock guard(&rescanLock);  // recursive
   bool running;
   {
     StateLock lock;
@@ -102,7 +89,7 @@ void RescanDrives() {
 void RestartWorkers() {
   // The same locks as a quiesce on the pipe thread, so that a restart never
   // meets workers that are still being stopped.
-  RescanGuard guard;
+  SectionLock guard(&rescanLock);  // recursive
   EnterCriticalSection(&workerStopLock);
   {
     StateLock lock;
@@ -115,7 +102,7 @@ void RestartWorkers() {
 }
 
 void QuiesceChannels() {
-  RescanGuard guard;
+  SectionLock guard(&rescanLock);  // recursive
   {
     StateLock lock;
     StateBlock* block = monitorState.stateBlock;
@@ -132,7 +119,7 @@ void QuiesceChannels() {
 }
 
 void QuiesceAndRescan() {
-  RescanGuard guard;
+  SectionLock guard(&rescanLock);  // recursive
   QuiesceChannels();
   RescanDrives();
 }

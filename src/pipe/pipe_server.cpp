@@ -65,10 +65,9 @@ bool ConnectInstance(PipeInstance& instance) {
   return true;
 }
 
-// Closes the instance's pipe (its event stays) and schedules it to be
-// created again; the first of a run of failures is logged.
-void SetAside(int index) {
-  PipeInstance& instance = instances[index];
+// Cancels the instance's operation, waits for the cancel (a pipe completes
+// it at once) and closes its pipe; its event stays.
+void ClosePipe(PipeInstance& instance) {
   if (instance.pipe != nullptr) {
     if (instance.pending) {
       DWORD ignored = 0;
@@ -79,6 +78,12 @@ void SetAside(int index) {
     instance.pipe = nullptr;
   }
   instance.pending = FALSE;
+}
+
+// Closes the instance's pipe (its event stays) and schedules it to be
+// created again; the first of a run of failures is logged.
+void SetAside(int index) {
+  ClosePipe(instances[index]);
   Retry& retry = retries[index];
   retry.pauseMs = retry.pauseMs == 0 ? kRetryFirstMs : retry.pauseMs * 2;
   if (retry.pauseMs > kRetryLimitMs) retry.pauseMs = kRetryLimitMs;
@@ -153,15 +158,7 @@ void ReconnectInstance(int index) {
 // Closes what the instances hold, ending their exchanges.
 void CloseInstances() {
   for (PipeInstance& instance : instances) {
-    if (instance.pipe != nullptr) {
-      if (instance.pending) {
-        DWORD ignored = 0;
-        CancelIo(instance.pipe);
-        GetOverlappedResult(instance.pipe, &instance.overlapped, &ignored, TRUE);
-      }
-      CloseHandle(instance.pipe);
-      instance.pipe = nullptr;
-    }
+    ClosePipe(instance);
     if (instance.overlapped.hEvent != nullptr) {
       CloseHandle(instance.overlapped.hEvent);
       instance.overlapped.hEvent = nullptr;

@@ -19,6 +19,20 @@ extern CRITICAL_SECTION rescanLock;
 // while the event is handled, so taken before the state mutex.
 extern CRITICAL_SECTION deviceEventLock;
 
+// Holds a critical section for a scope.
+class SectionLock {
+ public:
+  explicit SectionLock(CRITICAL_SECTION* section) : section_(section) {
+    EnterCriticalSection(section_);
+  }
+  ~SectionLock() { LeaveCriticalSection(section_); }
+  SectionLock(const SectionLock&) = delete;
+  SectionLock& operator=(const SectionLock&) = delete;
+
+ private:
+  CRITICAL_SECTION* section_;
+};
+
 // Initialises both locks; later calls do nothing (tests start the service
 // many times in one process).
 void InitializeProcessLocks();

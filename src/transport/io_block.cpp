@@ -2,22 +2,12 @@
 
 #include <vector>
 
+#include "service/process_locks.h"
 #include "transport/pass_through.h"
 
 namespace {
 
 // Holds a critical section for one scope.
-class Guard {
- public:
-  explicit Guard(CRITICAL_SECTION* section) : section_(section) { EnterCriticalSection(section_); }
-  ~Guard() { LeaveCriticalSection(section_); }
-  Guard(const Guard&) = delete;
-  Guard& operator=(const Guard&) = delete;
-
- private:
-  CRITICAL_SECTION* section_;
-};
-
 struct SetAside {
   CRITICAL_SECTION lock;
   std::vector<IoBlock*> blocks;
@@ -47,7 +37,7 @@ void Reap() {
   std::vector<IoBlock*> done;
   {
     SetAside& aside = Aside();
-    Guard guard(&aside.lock);
+    SectionLock guard(&aside.lock);
     for (auto it = aside.blocks.begin(); it != aside.blocks.end();) {
       if (Completed(*it)) {
         done.push_back(*it);
@@ -94,7 +84,7 @@ void AbandonIoBlock(HANDLE device, IoBlock* block) {
     Release(block);
   } else {
     SetAside& aside = Aside();
-    Guard guard(&aside.lock);
+    SectionLock guard(&aside.lock);
     aside.blocks.push_back(block);
   }
   SetLastError(error);
@@ -103,7 +93,7 @@ void AbandonIoBlock(HANDLE device, IoBlock* block) {
 std::size_t SetAsideIoBlockCount() {
   Reap();
   SetAside& aside = Aside();
-  Guard guard(&aside.lock);
+  SectionLock guard(&aside.lock);
   return aside.blocks.size();
 }
 

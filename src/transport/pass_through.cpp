@@ -12,15 +12,6 @@ constexpr ULONG kCommandTimeOutSeconds = 20;
 
 enum class WaitOutcome { Completed, Failed, Aborted, WaitFailed };
 
-// Holds passThroughLock for one transfer.
-class PassThroughLockHolder {
- public:
-  PassThroughLockHolder() { EnterCriticalSection(&passThroughLock); }
-  ~PassThroughLockHolder() { LeaveCriticalSection(&passThroughLock); }
-  PassThroughLockHolder(const PassThroughLockHolder&) = delete;
-  PassThroughLockHolder& operator=(const PassThroughLockHolder&) = delete;
-};
-
 void FillRequest(PassThroughRequest* request, BYTE cdbLength, BYTE dataIn, DWORD dataLength,
                  void* data, const BYTE* cdb) {
   SCSI_PASS_THROUGH_DIRECT& spt = request->spt;
@@ -214,7 +205,7 @@ DWORD ScsiReadCapacity(HANDLE device, DWORD* lastLba, DWORD* blockLength, HANDLE
 }
 
 DWORD ScsiInquiry(HANDLE device, BYTE* buffer, HANDLE abortEvent) {
-  PassThroughLockHolder lock;
+  SectionLock lock(&passThroughLock);
   ScsiBlock block = NewScsiBlock(kInquiryLength);
   if (block.io == nullptr) return NoMemory();
   const BYTE cdb[6] = {0x12, 0x00, 0x00, 0x00, kInquiryLength, 0x00};
@@ -223,7 +214,7 @@ DWORD ScsiInquiry(HANDLE device, BYTE* buffer, HANDLE abortEvent) {
 }
 
 DWORD ScsiInquiryPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE length, HANDLE abortEvent) {
-  PassThroughLockHolder lock;
+  SectionLock lock(&passThroughLock);
   ScsiBlock block = NewScsiBlock(length);
   if (block.io == nullptr) return NoMemory();
   const BYTE cdb[6] = {0x12, 0x01, pageCode, 0x00, length, 0x00};
@@ -237,7 +228,7 @@ DWORD ScsiInquiryPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE length, H
 DWORD ReceiveDiagnosticPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE length,
                             OVERLAPPED* overlapped, HANDLE abortEvent) {
   if (overlapped == nullptr) return ERROR_INVALID_PARAMETER;
-  PassThroughLockHolder lock;
+  SectionLock lock(&passThroughLock);
   ScsiBlock block = NewScsiBlock(length);
   if (block.io == nullptr) return NoMemory();
   const BYTE cdb[6] = {0x1C, 0x01, pageCode, 0x00, length, 0x00};
@@ -249,7 +240,7 @@ DWORD ReceiveDiagnosticPage(HANDLE device, BYTE pageCode, BYTE* buffer, BYTE len
 DWORD SendDiagnosticPage(HANDLE device, const BYTE* buffer, BYTE length, OVERLAPPED* overlapped,
                          HANDLE abortEvent) {
   if (overlapped == nullptr) return ERROR_INVALID_PARAMETER;
-  PassThroughLockHolder lock;
+  SectionLock lock(&passThroughLock);
   ScsiBlock block = NewScsiBlock(length);
   if (block.io == nullptr) return NoMemory();
   std::memcpy(block.data, buffer, length);

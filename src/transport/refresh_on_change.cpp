@@ -4,21 +4,11 @@
 
 #include "monitor/monitor_state.h"
 #include "platform/wide.h"
+#include "service/process_locks.h"
 
 namespace {
 
 // Holds a critical section for one scope.
-class Guard {
- public:
-  explicit Guard(CRITICAL_SECTION* section) : section_(section) { EnterCriticalSection(section_); }
-  ~Guard() { LeaveCriticalSection(section_); }
-  Guard(const Guard&) = delete;
-  Guard& operator=(const Guard&) = delete;
-
- private:
-  CRITICAL_SECTION* section_;
-};
-
 constexpr std::size_t kKeyUnits = 256;
 constexpr std::size_t kRemembered = 64;
 
@@ -84,7 +74,7 @@ void NoteRefreshConditions(const DriveRecord* drive, DWORD conditions, bool hold
   bool ask = false;
   {
     Table& table = Conditions();
-    Guard guard(&table.lock);
+    SectionLock guard(&table.lock);
     if (table.block != monitorState.stateBlock) {
       Reset(table);
       table.block = monitorState.stateBlock;
@@ -100,6 +90,6 @@ void NoteRefreshConditions(const DriveRecord* drive, DWORD conditions, bool hold
 
 void ForgetRefreshConditions() {
   Table& table = Conditions();
-  Guard guard(&table.lock);
+  SectionLock guard(&table.lock);
   Reset(table);
 }
