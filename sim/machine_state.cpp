@@ -179,7 +179,12 @@ std::string Machine::State::DriveName(int drive) const {
 void Machine::State::Record(Command command) {
   command.sequence = nextSequence++;
   commands.push_back(std::move(command));
-  if (const char* trace = std::getenv("SKYVANE_SIM_TRACE"); trace != nullptr && *trace != 0) {
+  if (commands.size() > kCommandRecordLimit) commands.pop_front();
+  static const bool traced = [] {
+    const char* trace = std::getenv("SKYVANE_SIM_TRACE");
+    return trace != nullptr && *trace != 0;
+  }();
+  if (traced) {
     std::fprintf(stderr, "[sim] %s\n", Describe(commands.back()).c_str());
   }
 }

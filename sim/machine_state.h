@@ -129,7 +129,10 @@ struct Machine::State {
   Language language = Language::English;
   std::vector<VolumeState> volumes;
   std::uint32_t nextDiskNumber = 1;
-  std::vector<Command> commands;
+  // The most recent commands, at most kCommandRecordLimit: a machine that
+  // runs for days (the demo service) must not grow without end.
+  std::deque<Command> commands;
+  static constexpr std::size_t kCommandRecordLimit = 1 << 16;
   std::uint64_t nextSequence = 1;
   std::vector<Machine::EjectRequest> ejects;
   std::set<std::string> removedExports;  // "module!name"
