@@ -1,0 +1,262 @@
+// Properties of the POSIX emulation itself that the conformance suite cannot
+// state (Windows has no counts to read): live handle and thread counts, which
+// the leak check after every case relies on, the time scale, the namespace
+// outliving dead processes, mapping lifetime, and device requests completed
+// by a device provider.
+#include <gtest/gtest.h>
+#include <stdlib.h>
+
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/diagnostics.h"
+#include "platform/posix/device_provider.h"
+#include "platform/win32.h"
+#include "support/child_process.h"
+#include "support/test_support.h"
+
+namespace {
+
+using skytest::Handle;
+using skytest::NewEvent;
+using skytest::RunAsChild;
+using skytest::Thread;
+
+TEST(Handles, CountedAndNeverValidAfterClose) {
+  long before = platform::LiveHandleCount();
+  HANDLE event = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+  HANDLE mutex = CreateMutexW(nullptr, FALSE, nullptr);
+  ASSERT_TRUE(event != nullptr && mutex != nullptr && event != mutex);
+  EXPECT_EQ(platform::LiveHandleCount(), before + 2);
+  EXPECT_TRUE(CloseHandle(event));
+  EXPECT_EQ(platform::LiveHandleCount(), before + 1);
+  // A handle of the wrong kind fails as a closed one does.
+  SetLastError(0);
+  EXPECT_FALSE(SetEvent(mutex));
+  EXPECT_EQ(GetLastError(), ERROR_INVALID_HANDLE);
+  // The closed value is not handed out again at once.
+  HANDLE next = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+  EXPECT_NE(next, event);
+  EXPECT_FALSE(SetEvent(event));
+  EXPECT_TRUE(CloseHandle(next));
+  EXPECT_TRUE(CloseHandle(mutex));
+  EXPECT_EQ(platform::LiveHandleCount(), before);
+  EXPECT_FALSE(CloseHandle(nullptr));
+  EXPECT_TRUE(CloseHandle(GetCurrentProcess()));
+}
+
+TEST(Threads, CountedUntilTheyEndEvenWithTheirHandleClosedFirst) {
+  Handle release = NewEvent(true, false);
+  HANDLE thread = CreateThread(
+      nullptr, 0, [](LPVOID p) -> DWORD { return WaitForSingleObject(p, INFINITE); }, release.Get(),
+      0, nullptr);
+  ASSERT_NE(thread, nullptr);
+  EXPECT_TRUE(CloseHandle(thread));
+  EXPECT_EQ(platform::LiveThreadCount(), 1);
+  SetEvent(release.Get());
+  while (platform::LiveThreadCount() != 0) Sleep(1);  // ends with the thread, or the case times out
+}
+
+TEST(Waits, SixtyFiveHandlesAreRefusedAndWaitAllTakesAllAtOnce) {
+  std::vector<Handle> events;
+  std::vector<HANDLE> raw;
+  for (DWORD i = 0; i <= MAXIMUM_WAIT_OBJECTS; ++i) {
+    events.push_back(NewEvent(false, false));
+    raw.push_back(events.back().Get());
+  }
+  SetEvent(raw[64]);
+  SetLastError(0);
+  EXPECT_EQ(WaitForMultipleObjects(65, raw.data(), FALSE, 0), WAIT_FAILED);
+  EXPECT_EQ(GetLastError(), ERROR_INVALID_PARAMETER);
+  EXPECT_EQ(WaitForSingleObject(raw[64], 0), WAIT_OBJECT_0);  // the refused wait took nothing
+  // Wait-all takes nothing until every object is signalled, then all at once.
+  SetEvent(raw[0]);
+  EXPECT_EQ(WaitForMultipleObjects(2, raw.data(), TRUE, 0), WAIT_TIMEOUT);
+  SetEvent(raw[1]);
+  EXPECT_EQ(WaitForMultipleObjects(2, raw.data(), TRUE, 0), WAIT_OBJECT_0);
+  EXPECT_EQ(WaitForMultipleObjects(2, raw.data(), FALSE, 0), WAIT_TIMEOUT);
+}
+
+// The factor is read once per process, so the check runs in a child started
+// with its own value: hours of emulated waiting pass in about 1.5 s.
+TEST(TimeScale, HoursOfWaitingPassQuicklyWithATinyScale) {
+  if (skytest::ChildRole() != nullptr) {
+    EXPECT_DOUBLE_EQ(platform::TimeScale(), 0.0001);
+    Handle event = NewEvent(false, false);
+    ULONGLONG start = GetTickCount64();
+    EXPECT_EQ(WaitForSingleObject(event.Get(), 10000000), WAIT_TIMEOUT);
+    Sleep(5000000);
+    EXPECT_GE(GetTickCount64() - start, 15000000u);  // the emulated clock ran as far
+    HANDLE pair[2] = {event.Get(), event.Get()};
+    EXPECT_EQ(WaitForMultipleObjects(2, pair, FALSE, 1), WAIT_TIMEOUT);
+    return;
+  }
+  const char* previous = getenv("SKYVANE_TIME_SCALE");
+  std::string saved = previous != nullptr ? previous : "";
+  setenv("SKYVANE_TIME_SCALE", "0.0001", 1);
+  int code = skytest::RunChildSelf("scaled", 120000);  // real time
+  if (previous != nullptr) {
+    setenv("SKYVANE_TIME_SCALE", saved.c_str(), 1);
+  } else {
+    unsetenv("SKYVANE_TIME_SCALE");
+  }
+  EXPECT_EQ(code, 0);
+}
+
+TEST(Namespace, ObjectsOfADeadProcessGoWithIt) {
+  RunAsChild("leaker", [] {
+    HANDLE event = CreateEventW(nullptr, TRUE, TRUE, WSTR("Global\\EmuXpLeaked"));
+    return event != nullptr ? 0 : 10;  // ends without closing
+  });
+  ASSERT_EQ(skytest::RunChildSelf("leaker", skytest::kProcessGuardMs), 0);
+  SetLastError(0);
+  Handle fresh(CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuXpLeaked")));
+  ASSERT_TRUE(fresh);
+  EXPECT_EQ(GetLastError(), ERROR_SUCCESS);  // a new object, not the dead one's
+  EXPECT_EQ(WaitForSingleObject(fresh.Get(), 0), WAIT_TIMEOUT);
+}
+
+// A view keeps its mapping alive after the last handle closed (in another
+// process too); the object goes with the last view.
+TEST(Namespace, AViewKeepsItsMappingAlive) {
+  constexpr DWORD kSize = 1215512;
+  RunAsChild("writer", [] {
+    HANDLE again = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0, 4096,
+                                      WSTR("Global\\EmuXpMap"));
+    if (again == nullptr || GetLastError() != ERROR_ALREADY_EXISTS) return 10;
+    auto* v = static_cast<unsigned char*>(MapViewOfFile(again, FILE_MAP_ALL_ACCESS, 0, 0, 0));
+    if (v == nullptr || v[kSize - 1] != 0x11) return 11;
+    CloseHandle(again);
+    v[0] = 0xA5;
+    return UnmapViewOfFile(v) ? 0 : 12;
+  });
+  HANDLE mapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0, kSize,
+                                      WSTR("Global\\EmuXpMap"));
+  ASSERT_NE(mapping, nullptr);
+  auto* view = static_cast<unsigned char*>(MapViewOfFile(mapping, FILE_MAP_ALL_ACCESS, 0, 0, 0));
+  ASSERT_NE(view, nullptr);
+  view[kSize - 1] = 0x11;
+  EXPECT_EQ(skytest::RunChildSelf("writer", skytest::kProcessGuardMs), 0);
+  EXPECT_EQ(view[0], 0xA5);
+  EXPECT_TRUE(CloseHandle(mapping));
+  Handle reopened(OpenFileMappingW(FILE_MAP_READ, FALSE, WSTR("Global\\EmuXpMap")));
+  EXPECT_TRUE(reopened);
+  reopened.Reset();
+  EXPECT_TRUE(UnmapViewOfFile(view));
+  EXPECT_FALSE(UnmapViewOfFile(view));
+  EXPECT_EQ(GetLastError(), ERROR_INVALID_ADDRESS);
+  EXPECT_EQ(OpenFileMappingW(FILE_MAP_READ, FALSE, WSTR("Global\\EmuXpMap")), nullptr);
+  EXPECT_EQ(GetLastError(), ERROR_FILE_NOT_FOUND);
+}
+
+// A device that answers code 1 at once, fails code 2 at once and keeps every
+// other request (and every read) pending until the test completes it.
+struct FakeDevice : emu::DeviceFile {
+  std::mutex lock;
+  std::vector<emu::IoRequestPtr> pending;
+  int cancels = 0;
+  emu::IoStart Control(DWORD code, const void*, DWORD, void*, DWORD,
+                       const emu::IoRequestPtr& request) override {
+    if (code == 1) return {false, ERROR_SUCCESS, 0};
+    if (code == 2) return {false, ERROR_INVALID_FUNCTION, 0};
+    return Read(nullptr, 0, request);
+  }
+  emu::IoStart Read(void*, DWORD, const emu::IoRequestPtr& request) override {
+    std::lock_guard<std::mutex> guard(lock);
+    pending.push_back(request);
+    return {true, ERROR_SUCCESS, 0};
+  }
+  emu::IoStart Write(const void*, DWORD length, const emu::IoRequestPtr&) override {
+    return {false, ERROR_SUCCESS, length};
+  }
+  void Cancel(const emu::IoRequestPtr& request) override {
+    {
+      std::lock_guard<std::mutex> guard(lock);
+      ++cancels;
+    }
+    emu::DeviceFile::Cancel(request);
+  }
+};
+
+struct FakeProvider : emu::DeviceProvider {
+  FakeDevice* last = nullptr;
+  std::unique_ptr<emu::DeviceFile> Open(const WCHAR* path, DWORD, DWORD, DWORD,
+                                        DWORD* error) override {
+    if (!WideEqual(path, WSTR("\\\\?\\fake#1"))) {
+      *error = ERROR_FILE_NOT_FOUND;
+      return nullptr;
+    }
+    auto device = std::make_unique<FakeDevice>();
+    last = device.get();
+    return device;
+  }
+};
+
+// The results of device requests: at once (success signals the event, a
+// failure leaves it alone), completed later from any thread (once only),
+// cancelled by the calling thread's CancelIo, or by the close of the handle.
+TEST(DeviceRequests, CompleteOnceAndCancelOnlyTheCallersOrAllOnClose) {
+  FakeProvider provider;
+  emu::SetDeviceProvider(&provider);
+  HANDLE device = CreateFileW(WSTR("\\\\?\\fake#1"), GENERIC_READ | GENERIC_WRITE, 0, nullptr,
+                              OPEN_EXISTING, FILE_FLAG_OVERLAPPED, nullptr);
+  ASSERT_NE(device, INVALID_HANDLE_VALUE);
+  Handle event = NewEvent(true, false);
+  OVERLAPPED ov{};
+  ov.hEvent = event.Get();
+  DWORD bytes = 0;
+  EXPECT_TRUE(DeviceIoControl(device, 1, nullptr, 0, nullptr, 0, &bytes, &ov));
+  EXPECT_EQ(WaitForSingleObject(event.Get(), 0), WAIT_OBJECT_0);
+  ResetEvent(event.Get());
+  EXPECT_FALSE(DeviceIoControl(device, 2, nullptr, 0, nullptr, 0, &bytes, &ov));
+  EXPECT_EQ(GetLastError(), ERROR_INVALID_FUNCTION);
+  EXPECT_EQ(WaitForSingleObject(event.Get(), 0), WAIT_TIMEOUT);
+
+  unsigned char out[8] = {};
+  EXPECT_FALSE(DeviceIoControl(device, 9, nullptr, 0, out, sizeof(out), &bytes, &ov));
+  EXPECT_EQ(GetLastError(), ERROR_IO_PENDING);
+  emu::IoRequestPtr request = provider.last->pending.back();
+  EXPECT_EQ(emu::IoOutputBuffer(request), out);
+  Thread completer([&]() -> DWORD {
+    static_cast<unsigned char*>(emu::IoOutputBuffer(request))[0] = 0xAB;
+    emu::CompleteIo(request, ERROR_SUCCESS, 1);
+    emu::CompleteIo(request, ERROR_GEN_FAILURE, 5);  // ignored
+    return 0;
+  });
+  EXPECT_TRUE(GetOverlappedResult(device, &ov, &bytes, TRUE));
+  EXPECT_EQ(bytes, 1u);
+  EXPECT_EQ(out[0], 0xAB);
+  EXPECT_EQ(completer.Join(), 0u);
+  EXPECT_EQ(ov.InternalHigh, 1u);
+
+  // Another thread's read stays pending through this thread's CancelIo, and
+  // after its thread ended, until the handle closes.
+  OVERLAPPED others{};
+  Handle othersEvent = NewEvent(true, false);
+  others.hEvent = othersEvent.Get();
+  Thread other([&]() -> DWORD {
+    char buffer[4];
+    ReadFile(device, buffer, 4, nullptr, &others);
+    return GetLastError();
+  });
+  EXPECT_EQ(other.Join(), ERROR_IO_PENDING);
+  OVERLAPPED mine{};
+  mine.hEvent = event.Get();
+  char buffer[4];
+  EXPECT_FALSE(ReadFile(device, buffer, 4, nullptr, &mine));
+  EXPECT_EQ(GetLastError(), ERROR_IO_PENDING);
+  EXPECT_TRUE(CancelIo(device));
+  bytes = 7;
+  EXPECT_FALSE(GetOverlappedResult(device, &mine, &bytes, TRUE));
+  EXPECT_EQ(GetLastError(), ERROR_OPERATION_ABORTED);
+  EXPECT_EQ(bytes, 0u);
+  EXPECT_EQ(provider.last->cancels, 1);
+  EXPECT_EQ(others.Internal, STATUS_PENDING);
+  CloseHandle(device);
+  EXPECT_EQ(WaitForSingleObject(othersEvent.Get(), skytest::kGuardMs), WAIT_OBJECT_0);
+  EXPECT_EQ(others.Internal, 0xC0000120u);  // STATUS_CANCELLED
+  emu::SetDeviceProvider(nullptr);
+}
+
+}  // namespace
