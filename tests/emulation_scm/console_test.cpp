@@ -1,5 +1,6 @@
 // Console control: terminal signals become console control events whose
-// handlers run on a thread of their own, last registered first.
+// handlers run on a thread of their own, last registered first; unhandled,
+// the event ends the process as the signal would.
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <unistd.h>
@@ -39,32 +40,20 @@ BOOL WINAPI SecondHandler(DWORD type) {
   return Record(2, type);
 }
 
-std::vector<Call> WaitForCalls(std::size_t count) {
+// The calls once `count` have come (or after ten seconds), as "handler:type".
+std::vector<Call> TakeCalls(std::size_t count) {
   std::unique_lock<std::mutex> guard(g_lock);
   g_changed.wait_for(guard, std::chrono::seconds(10), [&] { return g_calls.size() >= count; });
-  std::vector<Call> calls = g_calls;
-  g_calls.clear();
+  std::vector<Call> calls;
+  calls.swap(g_calls);
   return calls;
 }
 
-class ConsoleControl : public ::testing::Test {
- protected:
-  void SetUp() override {
-    ASSERT_TRUE(SetConsoleCtrlHandler(FirstHandler, TRUE));
-    ASSERT_TRUE(SetConsoleCtrlHandler(SecondHandler, TRUE));
-    g_secondHandles = false;
-    std::lock_guard<std::mutex> guard(g_lock);
-    g_calls.clear();
-  }
-  void TearDown() override {
-    SetConsoleCtrlHandler(SecondHandler, FALSE);
-    SetConsoleCtrlHandler(FirstHandler, FALSE);
-  }
-};
-
-TEST_F(ConsoleControl, SignalsRunHandlersLastRegisteredFirstOnAnotherThread) {
+TEST(ConsoleControl, HandlersRunLastRegisteredFirstOnAnotherThreadUntilOneHandles) {
+  ASSERT_TRUE(SetConsoleCtrlHandler(FirstHandler, TRUE));
+  ASSERT_TRUE(SetConsoleCtrlHandler(SecondHandler, TRUE));
   ASSERT_EQ(raise(SIGINT), 0);
-  std::vector<Call> calls = WaitForCalls(2);
+  std::vector<Call> calls = TakeCalls(2);
   ASSERT_EQ(calls.size(), 2u);
   EXPECT_EQ(calls[0].handler, 2);
   EXPECT_EQ(calls[1].handler, 1);
@@ -75,35 +64,27 @@ TEST_F(ConsoleControl, SignalsRunHandlersLastRegisteredFirstOnAnotherThread) {
   // SIGQUIT stands for Ctrl+Break; a handler returning TRUE ends the chain.
   g_secondHandles = true;
   ASSERT_EQ(raise(SIGQUIT), 0);
-  calls = WaitForCalls(1);
+  calls = TakeCalls(1);
   ASSERT_EQ(calls.size(), 1u);
   EXPECT_EQ(calls[0].handler, 2);
   EXPECT_EQ(calls[0].type, CTRL_BREAK_EVENT);
-}
 
-TEST_F(ConsoleControl, RemovingAndIgnoring) {
+  // Removed handlers are not called; a null handler ignores Ctrl+C only.
   ASSERT_TRUE(SetConsoleCtrlHandler(SecondHandler, FALSE));
   EXPECT_FALSE(SetConsoleCtrlHandler(SecondHandler, FALSE));
   EXPECT_EQ(GetLastError(), ERROR_INVALID_PARAMETER);
-  EXPECT_TRUE(emu::RaiseConsoleControl(CTRL_BREAK_EVENT));
-  std::vector<Call> calls = WaitForCalls(1);
-  ASSERT_EQ(calls.size(), 1u);
-  EXPECT_EQ(calls[0].handler, 1);
-
-  // A null handler makes the process ignore Ctrl+C, not Ctrl+Break.
   ASSERT_TRUE(SetConsoleCtrlHandler(nullptr, TRUE));
   EXPECT_TRUE(emu::RaiseConsoleControl(CTRL_C_EVENT));
   EXPECT_TRUE(emu::RaiseConsoleControl(CTRL_BREAK_EVENT));
-  calls = WaitForCalls(1);
+  calls = TakeCalls(1);
   ASSERT_EQ(calls.size(), 1u);
+  EXPECT_EQ(calls[0].handler, 1);
   EXPECT_EQ(calls[0].type, CTRL_BREAK_EVENT);
   ASSERT_TRUE(SetConsoleCtrlHandler(nullptr, FALSE));
-  ASSERT_TRUE(SetConsoleCtrlHandler(SecondHandler, TRUE));
+  ASSERT_TRUE(SetConsoleCtrlHandler(FirstHandler, FALSE));
 }
 
-// Unhandled, the event ends the process the way the signal would. The
-// child is a fresh run of this program (see tests/support/child_process.h).
-TEST(ConsoleDefault, UnhandledControlEndsTheProcess) {
+TEST(ConsoleControl, UnhandledControlEndsTheProcess) {
   if (skytest::ChildRole() != nullptr) {
     alarm(20);                                   // a broken default action must not hang the case
     SetConsoleCtrlHandler(SecondHandler, TRUE);  // returns FALSE: not handled
