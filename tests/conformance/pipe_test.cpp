@@ -18,6 +18,7 @@ namespace {
 using skytest::Handle;
 using skytest::kGuardMs;
 using skytest::NewEvent;
+using skytest::Overlapped;
 using skytest::Thread;
 
 constexpr DWORD kPipeBufferBytes = 10920;
@@ -42,15 +43,6 @@ Handle OpenClient(const WideString& name) {
   return Handle(CreateFileW(name.c_str(), GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING,
                             0, nullptr));
 }
-
-// An OVERLAPPED record with its own manual-reset event, as the service uses.
-struct Overlapped {
-  OVERLAPPED record{};
-  Handle event = NewEvent(true, false);
-  Overlapped() { record.hEvent = event.Get(); }
-  OVERLAPPED* Get() { return &record; }
-  bool Signalled() const { return WaitForSingleObject(event.Get(), 0) == WAIT_OBJECT_0; }
-};
 
 bool WriteMessage(HANDLE pipe, std::string_view text) {
   DWORD written = 0;

@@ -15,22 +15,7 @@
 namespace {
 
 using skytest::ChildRole;
-
-// An open registry key, closed at the end of its scope.
-class Key {
- public:
-  Key() = default;
-  Key(const Key&) = delete;
-  Key& operator=(const Key&) = delete;
-  ~Key() {
-    if (key_ != nullptr) RegCloseKey(key_);
-  }
-  HKEY* Out() { return &key_; }
-  HKEY Get() const { return key_; }
-
- private:
-  HKEY key_ = nullptr;
-};
+using Key = skytest::RegKey;
 
 // What RegQueryValueExW gave for a buffer of `capacity` bytes.
 struct Queried {

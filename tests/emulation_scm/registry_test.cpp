@@ -18,24 +18,11 @@
 #include "platform/posix/registry_store.h"
 #include "platform/wide.h"
 #include "platform/win32.h"
+#include "support/test_support.h"
 
 namespace {
 
-// Closes an HKEY at scope end.
-class Key {
- public:
-  Key() = default;
-  Key(const Key&) = delete;
-  Key& operator=(const Key&) = delete;
-  ~Key() {
-    if (key_ != nullptr) RegCloseKey(key_);
-  }
-  HKEY* Out() { return &key_; }
-  HKEY Get() const { return key_; }
-
- private:
-  HKEY key_ = nullptr;
-};
+using Key = skytest::RegKey;
 
 LSTATUS SetDword(HKEY key, const WCHAR* name, DWORD value) {
   return RegSetValueExW(key, name, 0, REG_DWORD, reinterpret_cast<const BYTE*>(&value),
@@ -300,22 +287,6 @@ TEST(RegistryStoreFile, RoundTripsAnyNamesAndData) {
   EXPECT_FALSE(emu::registry::Parse("SKYVANE-REGISTRY 1\nK 0 HKEY_USERS\\a\\b\nEND\n", orphan));
   EXPECT_EQ(orphan.Find(u"HKEY_USERS\\a\\b"), nullptr);
   EXPECT_NE(orphan.Find(u"HKEY_USERS"), nullptr);
-}
-
-TEST(RegistryStoreFile, MissingDirectoriesAreCreated) {
-  std::string saved = emu::RegistryStorePath();
-  char pattern[] = "/tmp/skyvane-emuscm-XXXXXX";
-  ASSERT_NE(mkdtemp(pattern), nullptr);
-  std::string nested = std::string(pattern) + "/a/b/registry.dat";
-  setenv("SKYVANE_REGISTRY", nested.c_str(), 1);
-  HKEY key = nullptr;
-  LSTATUS status = RegCreateKeyExW(HKEY_LOCAL_MACHINE, u"SOFTWARE\\X", 0, nullptr, 0,
-                                   KEY_ALL_ACCESS, nullptr, &key, nullptr);
-  if (key != nullptr) RegCloseKey(key);
-  setenv("SKYVANE_REGISTRY", saved.c_str(), 1);
-  EXPECT_EQ(status, ERROR_SUCCESS);
-  EXPECT_EQ(access(nested.c_str(), R_OK), 0);
-  EXPECT_EQ(std::system(("rm -rf " + std::string(pattern)).c_str()), 0);
 }
 
 }  // namespace

@@ -46,8 +46,6 @@ struct FakeService {
   bool mayRun = true;  // cleared to hold the service in start-pending
   DWORD acceptWhenRunning = SERVICE_ACCEPT_STOP;
   DWORD mainThreadId = 0;
-  WideString argument0;
-  DWORD argumentCount = 0;
   DWORD queryRemoveAnswer = NO_ERROR;
   std::vector<SeenControl> seen;
   std::function<void()> beforeRunning;  // run on the main thread before the running report
@@ -91,8 +89,7 @@ void FakeMain(DWORD argumentCount, LPWSTR* arguments) {
   FakeService& s = *g_service;
   std::unique_lock<std::mutex> guard(s.lock);
   s.mainThreadId = GetCurrentThreadId();
-  s.argumentCount = argumentCount;
-  s.argument0 = arguments[0];
+  EXPECT_TRUE(argumentCount == 1 && WideEqual(arguments[0], u"EmuTestSvc"));
   guard.unlock();
   SERVICE_STATUS_HANDLE handle = RegisterServiceCtrlHandlerExW(u"EmuTestSvc", FakeHandler, &s);
   guard.lock();
@@ -182,8 +179,6 @@ TEST_F(ServiceSession, RunsTheServiceAndItsControlsOnTheRightThreadsAndChecksRep
   EXPECT_EQ(state.mainThreadId, service.mainThreadId);
   EXPECT_NE(service.mainThreadId, dispatcherThreadId);
   EXPECT_NE(service.mainThreadId, GetCurrentThreadId());
-  EXPECT_EQ(service.argumentCount, 1u);
-  EXPECT_EQ(service.argument0, u"EmuTestSvc");
 
   // Every valid report, complete and in order; the refused ones are not kept.
   std::vector<SERVICE_STATUS> reports = emu::ServiceStatusReports();

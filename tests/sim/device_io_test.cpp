@@ -10,22 +10,14 @@
 #include <string>
 
 #include "sim_helpers.h"
+#include "support/test_support.h"
 
 namespace {
 
 using namespace simtest;
+using skytest::Overlapped;
 
 constexpr DWORD kWaitEvent = 0x223C04;  // the button filter driver's event wait
-
-// One overlapped request in flight: its own event and record.
-struct Overlapped {
-  Overlapped() : event(CreateEventW(nullptr, TRUE, FALSE, nullptr)) { record.hEvent = event; }
-  ~Overlapped() { CloseHandle(event); }
-  Overlapped(const Overlapped&) = delete;
-  Overlapped& operator=(const Overlapped&) = delete;
-  HANDLE event;
-  OVERLAPPED record{};
-};
 
 class DeviceIo : public DefaultMachineTest {};
 
@@ -153,7 +145,7 @@ TEST_F(DeviceIo, HungRequestIsCancelledAndASlowCancelStillWritesItsReply) {
   Overlapped ov;
   ASSERT_FALSE(Scsi(device, &request, &ov.record));
   ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
-  EXPECT_EQ(WaitForSingleObject(ov.event, 0), WAIT_TIMEOUT);
+  EXPECT_EQ(WaitForSingleObject(ov.event.Get(), 0), WAIT_TIMEOUT);
   ASSERT_TRUE(CancelIo(device));
   EXPECT_FALSE(GetOverlappedResult(device, &ov.record, &bytes, TRUE));
   EXPECT_EQ(GetLastError(), ERROR_OPERATION_ABORTED);
@@ -165,9 +157,9 @@ TEST_F(DeviceIo, HungRequestIsCancelledAndASlowCancelStillWritesItsReply) {
   Overlapped slow;
   ASSERT_FALSE(Scsi(device, &request, &slow.record));
   ASSERT_TRUE(CancelIo(device));
-  EXPECT_EQ(WaitForSingleObject(slow.event, 0), WAIT_TIMEOUT);
+  EXPECT_EQ(WaitForSingleObject(slow.event.Get(), 0), WAIT_TIMEOUT);
   machine->FinishHeldCancels();
-  ASSERT_EQ(WaitForSingleObject(slow.event, INFINITE), WAIT_OBJECT_0);
+  ASSERT_EQ(WaitForSingleObject(slow.event.Get(), INFINITE), WAIT_OBJECT_0);
   EXPECT_FALSE(GetOverlappedResult(device, &slow.record, &bytes, FALSE));
   EXPECT_EQ(GetLastError(), ERROR_OPERATION_ABORTED);
   EXPECT_EQ(data[4], 69);

@@ -46,45 +46,30 @@ class LeakCheck : public ::testing::EmptyTestEventListener {
 };
 
 #if !defined(_WIN32)
-struct Isolation {
-  std::filesystem::path registryDir;
-};
+std::filesystem::path g_registryDir;
 
 bool IsSet(const char* name) {
   const char* value = std::getenv(name);
   return value != nullptr && *value != '\0';
 }
 
-// The registry store goes into a directory of its own that is only named
-// here: the emulation creates it on the first registry write, so a program
-// that never touches the registry (or ends abnormally before) leaves nothing.
-void Isolate(Isolation& isolation) {
+// The registry store goes into a directory of its own, only named here: the
+// emulation creates it on the first registry write, and it goes at exit (also
+// when a case ends the process through exit()).
+void Isolate() {
   std::random_device random;
   std::string tag = std::to_string(getpid()) + "-" + std::to_string(random() % 1000000);
-  if (!IsSet("SKYVANE_NAMESPACE")) {
-    setenv("SKYVANE_NAMESPACE", ("t" + tag).c_str(), 1);
-  }
-  if (!IsSet("SKYVANE_REGISTRY")) {
-    std::filesystem::path directory;
-    do {
-      directory =
-          std::filesystem::temp_directory_path() /
-          ("skyvane-test-" + std::to_string(getpid()) + "-" + std::to_string(random() % 1000000));
-    } while (std::filesystem::exists(directory));
-    isolation.registryDir = directory;
-    setenv("SKYVANE_REGISTRY", (directory / "registry").c_str(), 1);
-  }
-}
-
-Isolation g_isolation;
-
-// Runs at exit, also when a case ends the process through exit().
-void Release() {
-  const Isolation& isolation = g_isolation;
-  if (!isolation.registryDir.empty()) {
+  if (!IsSet("SKYVANE_NAMESPACE")) setenv("SKYVANE_NAMESPACE", ("t" + tag).c_str(), 1);
+  if (IsSet("SKYVANE_REGISTRY")) return;
+  do {
+    g_registryDir = std::filesystem::temp_directory_path() /
+                    ("skyvane-test-" + tag + "-" + std::to_string(random() % 1000));
+  } while (std::filesystem::exists(g_registryDir));
+  setenv("SKYVANE_REGISTRY", (g_registryDir / "registry").c_str(), 1);
+  std::atexit([] {
     std::error_code ignored;
-    std::filesystem::remove_all(isolation.registryDir, ignored);
-  }
+    std::filesystem::remove_all(g_registryDir, ignored);
+  });
 }
 #endif
 
@@ -92,8 +77,7 @@ void Release() {
 
 int main(int argc, char** argv) {
 #if !defined(_WIN32)
-  Isolate(g_isolation);
-  std::atexit(Release);
+  Isolate();
 #endif
   ::testing::InitGoogleTest(&argc, argv);
   ::testing::UnitTest::GetInstance()->listeners().Append(new LeakCheck);

@@ -60,6 +60,33 @@ inline Handle NewEvent(bool manualReset = true, bool signalled = false) {
   return Handle(CreateEventW(nullptr, manualReset, signalled, nullptr));
 }
 
+// An OVERLAPPED record with its own manual-reset event, as the service uses.
+struct Overlapped {
+  OVERLAPPED record{};
+  Handle event = NewEvent(true, false);
+  Overlapped() { record.hEvent = event.Get(); }
+  Overlapped(const Overlapped&) = delete;
+  Overlapped& operator=(const Overlapped&) = delete;
+  OVERLAPPED* Get() { return &record; }
+  bool Signalled() const { return WaitForSingleObject(event.Get(), 0) == WAIT_OBJECT_0; }
+};
+
+// An open registry key, closed at the end of its scope.
+class RegKey {
+ public:
+  RegKey() = default;
+  RegKey(const RegKey&) = delete;
+  RegKey& operator=(const RegKey&) = delete;
+  ~RegKey() {
+    if (key_ != nullptr) RegCloseKey(key_);
+  }
+  HKEY* Out() { return &key_; }
+  HKEY Get() const { return key_; }
+
+ private:
+  HKEY key_ = nullptr;
+};
+
 // A thread that runs `body`; its handle is closed, after the thread ended,
 // when the object goes.
 class Thread {
