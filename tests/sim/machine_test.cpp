@@ -1,6 +1,6 @@
 // The machine as a whole: description texts (their errors, and a drive that
-// answers as written), the machine the environment names, many drives,
-// device events one at a time, and the libraries the service loads.
+// answers as written), the machine the environment names, many drives, and
+// device events one at a time.
 #include <gtest/gtest.h>
 
 #include <chrono>
@@ -10,7 +10,6 @@
 #include <fstream>
 #include <set>
 
-#include "platform/diagnostics.h"
 #include "sim_helpers.h"
 
 namespace {
@@ -157,31 +156,6 @@ TEST_F(MachineTest, DeviceEventsAreDeliveredOneAtATime) {
   ASSERT_TRUE(machine->WaitForDeviceEvents());
   std::lock_guard<std::mutex> lock(gate);
   EXPECT_GT(delivered, 2);
-}
-
-TEST_F(MachineTest, LibrariesAreCountedAndTheirExportsCanBeRemoved) {
-  const long handlesBefore = platform::LiveHandleCount();
-  HMODULE hid = LoadLibraryW(WSTR("hid.dll"));
-  ASSERT_NE(hid, nullptr);
-  EXPECT_EQ(LoadLibraryW(WSTR("HID")), hid);  // same module, counted twice
-  EXPECT_EQ(reinterpret_cast<void*>(GetProcAddress(hid, "HidD_GetInputReport")),
-            reinterpret_cast<void*>(&HidD_GetInputReport));
-  machine->RemoveExport("hid.dll", "HidD_GetInputReport");
-  EXPECT_EQ(GetProcAddress(hid, "HidD_GetInputReport"), nullptr);
-  EXPECT_EQ(GetLastError(), ERROR_PROC_NOT_FOUND);
-  EXPECT_NE(GetProcAddress(hid, "HidD_GetSerialNumberString"), nullptr);
-  EXPECT_TRUE(FreeLibrary(hid));
-  EXPECT_TRUE(FreeLibrary(hid));
-  EXPECT_FALSE(FreeLibrary(hid));
-  EXPECT_EQ(platform::LiveHandleCount(), handlesBefore);
-  EXPECT_EQ(LoadLibraryW(WSTR("kernel99.dll")), nullptr);
-  EXPECT_EQ(GetLastError(), ERROR_MOD_NOT_FOUND);
-  HMODULE setupapi = LoadLibraryW(WSTR("C:\\WINDOWS\\system32\\SETUPAPI.DLL"));
-  ASSERT_NE(setupapi, nullptr);
-  for (const char* name : {"CM_Request_Device_EjectA", "CM_Query_And_Remove_SubTreeW"}) {
-    EXPECT_NE(GetProcAddress(setupapi, name), nullptr) << name;
-  }
-  EXPECT_TRUE(FreeLibrary(setupapi));
 }
 
 }  // namespace
