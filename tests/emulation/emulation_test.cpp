@@ -1,8 +1,8 @@
 // Properties of the POSIX emulation itself that the conformance suite cannot
 // state (Windows has no counts to read): live handle and thread counts, which
 // the leak check after every case relies on, the time scale, the namespace
-// outliving dead processes, mapping lifetime, and device requests completed
-// by a device provider.
+// outliving dead processes, and device requests completed by a device
+// provider.
 #include <gtest/gtest.h>
 #include <stdlib.h>
 
@@ -95,39 +95,6 @@ TEST(Namespace, ObjectsOfADeadProcessGoWithIt) {
   ASSERT_TRUE(fresh);
   EXPECT_EQ(GetLastError(), ERROR_SUCCESS);  // a new object, not the dead one's
   EXPECT_EQ(WaitForSingleObject(fresh.Get(), 0), WAIT_TIMEOUT);
-}
-
-// A view keeps its mapping alive after the last handle closed (in another
-// process too); the object goes with the last view.
-TEST(Namespace, AViewKeepsItsMappingAlive) {
-  constexpr DWORD kSize = 1215512;
-  RunAsChild("writer", [] {
-    HANDLE again = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0, 4096,
-                                      WSTR("Global\\EmuXpMap"));
-    if (again == nullptr || GetLastError() != ERROR_ALREADY_EXISTS) return 10;
-    auto* v = static_cast<unsigned char*>(MapViewOfFile(again, FILE_MAP_ALL_ACCESS, 0, 0, 0));
-    if (v == nullptr || v[kSize - 1] != 0x11) return 11;
-    CloseHandle(again);
-    v[0] = 0xA5;
-    return UnmapViewOfFile(v) ? 0 : 12;
-  });
-  HANDLE mapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0, kSize,
-                                      WSTR("Global\\EmuXpMap"));
-  ASSERT_NE(mapping, nullptr);
-  auto* view = static_cast<unsigned char*>(MapViewOfFile(mapping, FILE_MAP_ALL_ACCESS, 0, 0, 0));
-  ASSERT_NE(view, nullptr);
-  view[kSize - 1] = 0x11;
-  EXPECT_EQ(skytest::RunChildSelf("writer", skytest::kProcessGuardMs), 0);
-  EXPECT_EQ(view[0], 0xA5);
-  EXPECT_TRUE(CloseHandle(mapping));
-  Handle reopened(OpenFileMappingW(FILE_MAP_READ, FALSE, WSTR("Global\\EmuXpMap")));
-  EXPECT_TRUE(reopened);
-  reopened.Reset();
-  EXPECT_TRUE(UnmapViewOfFile(view));
-  EXPECT_FALSE(UnmapViewOfFile(view));
-  EXPECT_EQ(GetLastError(), ERROR_INVALID_ADDRESS);
-  EXPECT_EQ(OpenFileMappingW(FILE_MAP_READ, FALSE, WSTR("Global\\EmuXpMap")), nullptr);
-  EXPECT_EQ(GetLastError(), ERROR_FILE_NOT_FOUND);
 }
 
 // A device that keeps every request pending until the test completes it.
