@@ -108,12 +108,12 @@ TEST(MachineDescription, EnvironmentNamesAnotherMachineAndAMissingFileGivesTheDe
 TEST(MachineDescription, SeventyDrivesAllEnumerateWithTheirOwnIds) {
   sim::Machine machine;
   for (int i = 0; i < 70; ++i) {
-    sim::DriveSpec spec;
-    spec.name = "d" + std::to_string(i);
+    sim::DriveSpec drive;
+    drive.name = "d" + std::to_string(i);
     char serial[16];
     std::snprintf(serial, sizeof serial, "QX-S%04d", i);
-    spec.serial = serial;
-    machine.AddDrive(spec);
+    drive.serial = serial;
+    machine.AddDrive(drive);
   }
   machine.Install();
   std::set<std::string> ids;
