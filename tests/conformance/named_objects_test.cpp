@@ -1,10 +1,12 @@
 // Named kernel objects under "Global\": the pagefile-backed mapping, the
-// mutex and events that the service shares with the user-interface process.
-// Creating an existing name opens the same object (ERROR_ALREADY_EXISTS), a
-// second process sees it, and the object lives as long as any handle does.
+// mutex and the events that the service shares with the user-interface
+// process. Creating an existing name opens the same object
+// (ERROR_ALREADY_EXISTS), another process sees it, and it lives as long as
+// any handle does.
 #include <gtest/gtest.h>
 
 #include <cstring>
+#include <functional>
 
 #include "support/child_process.h"
 #include "support/test_support.h"
@@ -14,12 +16,11 @@ namespace {
 using skytest::ChildRole;
 using skytest::Handle;
 using skytest::kGuardMs;
-using skytest::UniqueName;
 
 constexpr DWORD kBlockBytes = 1215512;  // the size of the service's state block
 
 WideString GlobalName(const char* tag) {
-  return UniqueName("Global\\", tag);
+  return skytest::UniqueName("Global\\", tag);
 }
 
 // A mapped view, unmapped at the end of its scope.
@@ -54,6 +55,69 @@ Handle CreateBlockMapping(const WideString& name, SECURITY_ATTRIBUTES* attribute
                                    name.c_str()));
 }
 
+// The three kinds of named object, each with its create and open call and a
+// check that two handles reach one object.
+struct Kind {
+  const char* name;
+  std::function<HANDLE(const WCHAR*)> create;
+  std::function<HANDLE(const WCHAR*)> open;
+  std::function<bool(HANDLE, HANDLE)> same;
+};
+
+const Kind kKinds[] = {
+    {"mapping",
+     [](const WCHAR* name) {
+       return CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0, kBlockBytes,
+                                 name);
+     },
+     [](const WCHAR* name) { return OpenFileMappingW(FILE_MAP_READ, FALSE, name); },
+     [](HANDLE a, HANDLE b) {
+       View first(a, FILE_MAP_ALL_ACCESS);
+       View second(b, FILE_MAP_READ);
+       if (!first || !second) return false;
+       first.Bytes()[12345] = 0xC3;
+       return second.Bytes()[12345] == 0xC3;
+     }},
+    {"event", [](const WCHAR* name) { return CreateEventW(nullptr, TRUE, FALSE, name); },
+     [](const WCHAR* name) { return OpenEventW(EVENT_MODIFY_STATE | SYNCHRONIZE, FALSE, name); },
+     [](HANDLE a, HANDLE b) { return SetEvent(a) && WaitForSingleObject(b, 0) == WAIT_OBJECT_0; }},
+    {"mutex", [](const WCHAR* name) { return CreateMutexW(nullptr, FALSE, name); },
+     [](const WCHAR* name) { return OpenMutexW(SYNCHRONIZE | MUTEX_MODIFY_STATE, FALSE, name); },
+     // Ownership taken through one handle is released through the other.
+     [](HANDLE a, HANDLE b) {
+       return WaitForSingleObject(a, 0) == WAIT_OBJECT_0 && ReleaseMutex(b);
+     }},
+};
+
+TEST(NamedObjects, CreatingOrOpeningANameReachesTheSameObjectOfItsKindOnly) {
+  for (const Kind& kind : kKinds) {
+    SCOPED_TRACE(kind.name);
+    WideString name = GlobalName(kind.name);
+    SetLastError(0);
+    EXPECT_EQ(kind.open(name.c_str()), nullptr);
+    EXPECT_EQ(GetLastError(), ERROR_FILE_NOT_FOUND);
+    SetLastError(ERROR_INVALID_DATA);
+    Handle first(kind.create(name.c_str()));
+    ASSERT_TRUE(first);
+    EXPECT_EQ(GetLastError(), ERROR_SUCCESS);  // a new object
+    SetLastError(0);
+    Handle again(kind.create(name.c_str()));
+    ASSERT_TRUE(again);
+    EXPECT_EQ(GetLastError(), ERROR_ALREADY_EXISTS);
+    Handle opened(kind.open(name.c_str()));
+    ASSERT_TRUE(opened);
+    EXPECT_TRUE(kind.same(first.Get(), again.Get()));
+    EXPECT_TRUE(kind.same(again.Get(), opened.Get()));
+    // A name held by another kind of object is refused.
+    for (const Kind& other : kKinds) {
+      if (&other == &kind) continue;
+      SetLastError(0);
+      EXPECT_FALSE(Handle(other.create(name.c_str()))) << other.name;
+      EXPECT_EQ(GetLastError(), ERROR_INVALID_HANDLE) << other.name;
+    }
+  }
+}
+
 TEST(NamedObjects, MappingCreatedByOneProcessIsReadByAnother) {
   WideString name = GlobalName("map");
   if (ChildRole() != nullptr) {
@@ -67,91 +131,21 @@ TEST(NamedObjects, MappingCreatedByOneProcessIsReadByAnother) {
     EXPECT_EQ(view.Bytes()[kBlockBytes - 1], 0x5A);
     EXPECT_EQ(view.Bytes()[kBlockBytes / 2], 0);  // never written: zero-filled
     std::memcpy(view.Bytes() + 1000, "seen", 4);
-    // Creating the name again here opens the parent's block too.
     SetLastError(0);
-    Handle created = CreateBlockMapping(name);
+    Handle created = CreateBlockMapping(name);  // opens the parent's block too
     ASSERT_TRUE(created);
     EXPECT_EQ(GetLastError(), ERROR_ALREADY_EXISTS);
-    View second(created.Get(), FILE_MAP_READ);
-    ASSERT_TRUE(second);
-    EXPECT_EQ(std::memcmp(second.Bytes() + 1000, "seen", 4), 0);
     return;
   }
   OpenToAll security;
-  SetLastError(ERROR_INVALID_DATA);
   Handle mapping = CreateBlockMapping(name, &security.attributes);
   ASSERT_TRUE(mapping);
-  EXPECT_EQ(GetLastError(), ERROR_SUCCESS);  // a new object
   View view(mapping.Get(), FILE_MAP_ALL_ACCESS);
   ASSERT_TRUE(view);
   std::memcpy(view.Bytes(), "block", 5);
   view.Bytes()[kBlockBytes - 1] = 0x5A;
-
   ASSERT_EQ(skytest::RunChildSelf("reader", skytest::kProcessGuardMs), 0);
   EXPECT_EQ(std::memcmp(view.Bytes() + 1000, "seen", 4), 0);
-}
-
-TEST(NamedObjects, CreatingAnExistingNameOpensTheSameObject) {
-  WideString mapName = GlobalName("map");
-  Handle first = CreateBlockMapping(mapName);
-  ASSERT_TRUE(first);
-  SetLastError(0);
-  Handle second = CreateBlockMapping(mapName);
-  ASSERT_TRUE(second);
-  EXPECT_EQ(GetLastError(), ERROR_ALREADY_EXISTS);
-  View a(first.Get(), FILE_MAP_ALL_ACCESS);
-  View b(second.Get(), FILE_MAP_READ);
-  ASSERT_TRUE(a && b);
-  a.Bytes()[12345] = 0xC3;
-  EXPECT_EQ(b.Bytes()[12345], 0xC3);
-
-  WideString eventName = GlobalName("event");
-  Handle event(CreateEventW(nullptr, TRUE, FALSE, eventName.c_str()));
-  ASSERT_TRUE(event);
-  SetLastError(0);
-  Handle sameEvent(CreateEventW(nullptr, TRUE, FALSE, eventName.c_str()));
-  ASSERT_TRUE(sameEvent);
-  EXPECT_EQ(GetLastError(), ERROR_ALREADY_EXISTS);
-  ASSERT_TRUE(SetEvent(event.Get()));
-  EXPECT_EQ(WaitForSingleObject(sameEvent.Get(), 0), WAIT_OBJECT_0);
-
-  WideString mutexName = GlobalName("mutex");
-  Handle mutex(CreateMutexW(nullptr, FALSE, mutexName.c_str()));
-  ASSERT_TRUE(mutex);
-  SetLastError(0);
-  Handle sameMutex(CreateMutexW(nullptr, FALSE, mutexName.c_str()));
-  ASSERT_TRUE(sameMutex);
-  EXPECT_EQ(GetLastError(), ERROR_ALREADY_EXISTS);
-  // Ownership taken through one handle is released through the other.
-  ASSERT_EQ(WaitForSingleObject(mutex.Get(), 0), WAIT_OBJECT_0);
-  EXPECT_TRUE(ReleaseMutex(sameMutex.Get()));
-}
-
-TEST(NamedObjects, OpeningAMissingNameGivesFileNotFound) {
-  WideString name = GlobalName("absent");
-  SetLastError(0);
-  EXPECT_EQ(OpenFileMappingW(FILE_MAP_READ, FALSE, name.c_str()), nullptr);
-  EXPECT_EQ(GetLastError(), ERROR_FILE_NOT_FOUND);
-  SetLastError(0);
-  EXPECT_EQ(OpenEventW(EVENT_MODIFY_STATE | SYNCHRONIZE, FALSE, name.c_str()), nullptr);
-  EXPECT_EQ(GetLastError(), ERROR_FILE_NOT_FOUND);
-  SetLastError(0);
-  EXPECT_EQ(OpenMutexW(SYNCHRONIZE, FALSE, name.c_str()), nullptr);
-  EXPECT_EQ(GetLastError(), ERROR_FILE_NOT_FOUND);
-}
-
-TEST(NamedObjects, NameHeldByAnotherKindOfObjectIsRefused) {
-  WideString name = GlobalName("event");
-  Handle event(CreateEventW(nullptr, TRUE, FALSE, name.c_str()));
-  ASSERT_TRUE(event);
-  SetLastError(0);
-  Handle mutex(CreateMutexW(nullptr, FALSE, name.c_str()));
-  EXPECT_FALSE(mutex);
-  EXPECT_EQ(GetLastError(), ERROR_INVALID_HANDLE);
-  SetLastError(0);
-  Handle mapping = CreateBlockMapping(name);
-  EXPECT_FALSE(mapping);
-  EXPECT_EQ(GetLastError(), ERROR_INVALID_HANDLE);
 }
 
 TEST(NamedObjects, MappingLivesAsLongAsAnyHandleAndThenGoes) {
@@ -174,7 +168,6 @@ TEST(NamedObjects, MappingLivesAsLongAsAnyHandleAndThenGoes) {
     EXPECT_EQ(view.Bytes()[kBlockBytes - 4], 0x77);
   }
   reader.Reset();
-
   // With the last handle closed the name is free and a new block starts zeroed.
   SetLastError(ERROR_INVALID_DATA);
   Handle fresh = CreateBlockMapping(name);
@@ -209,14 +202,12 @@ TEST(NamedObjects, MutexAndEventsWorkAcrossProcessesAndAbandonOnExit) {
   Handle ready(CreateEventW(&security.attributes, TRUE, FALSE, readyName.c_str()));
   Handle go(CreateEventW(&security.attributes, FALSE, FALSE, goName.c_str()));
   ASSERT_TRUE(mutex && ready && go);
-
   skytest::ChildProcess child;
   ASSERT_TRUE(child.Start("peer"));
   ASSERT_EQ(WaitForSingleObject(ready.Get(), kGuardMs), WAIT_OBJECT_0);
   ASSERT_TRUE(ReleaseMutex(mutex.Get()));
   ASSERT_TRUE(SetEvent(go.Get()));
   ASSERT_EQ(child.Wait(skytest::kProcessGuardMs), 0);
-
   EXPECT_EQ(WaitForSingleObject(mutex.Get(), kGuardMs), WAIT_ABANDONED);
   EXPECT_TRUE(ReleaseMutex(mutex.Get()));
 }

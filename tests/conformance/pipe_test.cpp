@@ -1,60 +1,122 @@
-// Named pipes in message mode as the service's pipe server uses them:
-// overlapped connects, message boundaries, ERROR_MORE_DATA, the instance
-// limit, disconnection in both directions, reconnection, first-instance
-// creation, WaitNamedPipeW and TransactNamedPipe.
+// Named pipes in message mode and overlapped I/O on them, as the service's
+// pipe server and its clients use them: overlapped connects, reads that pend
+// and complete through their event, GetOverlappedResult, CancelIo (the calling
+// thread's requests only), message boundaries, ERROR_MORE_DATA, the instance
+// limit, disconnection from either side or by a dying process.
 #include <gtest/gtest.h>
 
 #include <cstdlib>
 #include <string>
+#include <string_view>
 #include <vector>
 
-#include "pipe_helpers.h"
 #include "support/child_process.h"
+#include "support/test_support.h"
 
 namespace {
 
-using conformance::ConnectOverlapped;
-using conformance::CreateServer;
-using conformance::Handle;
-using conformance::kGuardMs;
-using conformance::OpenClient;
-using conformance::Overlapped;
-using conformance::PipeName;
-using conformance::WriteMessage;
-using conformance::WriteOverlapped;
+using skytest::Handle;
+using skytest::kGuardMs;
+using skytest::NewEvent;
+using skytest::Overlapped;
+using skytest::Thread;
 
+constexpr DWORD kPipeBufferBytes = 10920;
 constexpr DWORD kErrorSemTimeout = 121;  // WaitNamedPipeW's time-out
 
+WideString PipeName() {
+  return skytest::UniqueName("\\\\.\\pipe\\", "pipe");
+}
+
+// One server instance as the service creates it: duplex, overlapped, message
+// type and read mode.
+Handle CreateServer(const WideString& name, DWORD maxInstances = 16, DWORD extraFlags = 0,
+                    SECURITY_ATTRIBUTES* attributes = nullptr) {
+  return Handle(
+      CreateNamedPipeW(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED | extraFlags,
+                       PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, maxInstances,
+                       kPipeBufferBytes, kPipeBufferBytes, 5000, attributes));
+}
+
+// A synchronous client end.
+Handle OpenClient(const WideString& name) {
+  return Handle(CreateFileW(name.c_str(), GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING,
+                            0, nullptr));
+}
+
+bool WriteMessage(HANDLE pipe, std::string_view text) {
+  DWORD written = 0;
+  return WriteFile(pipe, text.data(), static_cast<DWORD>(text.size()), &written, nullptr) &&
+         written == text.size();
+}
+
+// One message written on an overlapped handle, waiting for the write.
+bool WriteOverlapped(HANDLE pipe, std::string_view text) {
+  Overlapped write;
+  DWORD written = 0;
+  if (!WriteFile(pipe, text.data(), static_cast<DWORD>(text.size()), &written, write.Get()) &&
+      GetLastError() != ERROR_IO_PENDING) {
+    return false;
+  }
+  return GetOverlappedResult(pipe, write.Get(), &written, TRUE) && written == text.size();
+}
+
+// The error an overlapped connect left (0 on success).
+DWORD ConnectOverlapped(HANDLE server, Overlapped& overlapped) {
+  SetLastError(0);
+  return ConnectNamedPipe(server, overlapped.Get()) ? 0 : GetLastError();
+}
+
+// Starts an overlapped read of `buffer`; the error it left (0 when done).
+DWORD StartRead(HANDLE pipe, Overlapped& read, char* buffer, DWORD capacity) {
+  DWORD bytes = 0;
+  SetLastError(0);
+  return ReadFile(pipe, buffer, capacity, &bytes, read.Get()) ? 0 : GetLastError();
+}
+
 // Reads one message (or what fits) from the overlapped server end, waiting
-// for it; returns the read's error (0 on success) and the text in `text`.
+// for it: the read's error (0 on success), the text in `text`.
 DWORD ReadServer(HANDLE server, std::string& text, DWORD capacity = 256) {
   Overlapped read;
   std::vector<char> buffer(capacity);
   DWORD bytes = 0;
-  SetLastError(0);
-  BOOL done = ReadFile(server, buffer.data(), capacity, &bytes, read.Get());
-  DWORD error = done ? 0 : GetLastError();
-  // The count of a read that ended with ERROR_MORE_DATA is reported, as for a
-  // pending one, by GetOverlappedResult.
-  if (error == ERROR_IO_PENDING || error == ERROR_MORE_DATA) {
-    done = GetOverlappedResult(server, read.Get(), &bytes, TRUE);
-    error = done ? 0 : GetLastError();
+  DWORD error = StartRead(server, read, buffer.data(), capacity);
+  // The count of a read that ended with ERROR_MORE_DATA is reported, as for
+  // a pending one, by GetOverlappedResult.
+  if (error == ERROR_IO_PENDING || error == ERROR_MORE_DATA || error == 0) {
+    error = GetOverlappedResult(server, read.Get(), &bytes, TRUE) ? 0 : GetLastError();
   }
   text.assign(buffer.data(), bytes);
   return error;
 }
 
-TEST(Pipe, OverlappedConnectPendsUntilAClientOpens) {
+// A server instance (overlapped) with its synchronous client connected.
+struct Connection {
+  Handle server;
+  Handle client;
+  explicit Connection(const WideString& name = PipeName())
+      : server(CreateServer(name)), client(OpenClient(name)) {
+    Overlapped connect;
+    EXPECT_TRUE(server && client);
+    EXPECT_EQ(ConnectOverlapped(server.Get(), connect), ERROR_PIPE_CONNECTED);
+  }
+};
+
+TEST(Pipe, ConnectPendsUntilAClientOpensAndAnEarlierClientIsAlreadyConnected) {
   WideString name = PipeName();
+  SetLastError(0);
+  EXPECT_FALSE(WaitNamedPipeW(name.c_str(), 1));
+  EXPECT_EQ(GetLastError(), ERROR_FILE_NOT_FOUND);
+  SetLastError(0);
+  EXPECT_FALSE(OpenClient(name));
+  EXPECT_EQ(GetLastError(), ERROR_FILE_NOT_FOUND);
+
   // The service creates its instances with a null DACL so any account may open them.
   SECURITY_DESCRIPTOR descriptor{};
   ASSERT_TRUE(InitializeSecurityDescriptor(&descriptor, SECURITY_DESCRIPTOR_REVISION));
   ASSERT_TRUE(SetSecurityDescriptorDacl(&descriptor, TRUE, nullptr, FALSE));
   SECURITY_ATTRIBUTES attributes{sizeof(attributes), &descriptor, FALSE};
-  Handle server(CreateNamedPipeW(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
-                                 PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, 16,
-                                 conformance::kPipeBufferBytes, conformance::kPipeBufferBytes, 5000,
-                                 &attributes));
+  Handle server = CreateServer(name, 16, 0, &attributes);
   ASSERT_TRUE(server);
   Overlapped connect;
   ASSERT_EQ(ConnectOverlapped(server.Get(), connect), ERROR_IO_PENDING);
@@ -62,129 +124,209 @@ TEST(Pipe, OverlappedConnectPendsUntilAClientOpens) {
   DWORD bytes = 0;
   EXPECT_FALSE(GetOverlappedResult(server.Get(), connect.Get(), &bytes, FALSE));
   EXPECT_EQ(GetLastError(), ERROR_IO_INCOMPLETE);
-
+  EXPECT_TRUE(WaitNamedPipeW(name.c_str(), kGuardMs));
   Handle client = OpenClient(name);
   ASSERT_TRUE(client);
   ASSERT_EQ(WaitForSingleObject(connect.event.Get(), kGuardMs), WAIT_OBJECT_0);
   EXPECT_TRUE(GetOverlappedResult(server.Get(), connect.Get(), &bytes, FALSE));
-
   ASSERT_TRUE(WriteMessage(client.Get(), "ping"));
   std::string text;
   ASSERT_EQ(ReadServer(server.Get(), text), 0u);
   EXPECT_EQ(text, "ping");
-}
 
-TEST(Pipe, ClientThatCameFirstGivesPipeConnected) {
-  WideString name = PipeName();
-  Handle server = CreateServer(name);
-  ASSERT_TRUE(server);
-  Handle client = OpenClient(name);
-  ASSERT_TRUE(client);
-  Overlapped connect;
-  EXPECT_EQ(ConnectOverlapped(server.Get(), connect), ERROR_PIPE_CONNECTED);
-  ASSERT_TRUE(WriteMessage(client.Get(), "first"));
-  std::string text;
-  ASSERT_EQ(ReadServer(server.Get(), text), 0u);
+  Connection early(name);  // the client came first: ERROR_PIPE_CONNECTED
+  ASSERT_TRUE(WriteMessage(early.client.Get(), "first"));
+  ASSERT_EQ(ReadServer(early.server.Get(), text), 0u);
   EXPECT_EQ(text, "first");
 }
 
-TEST(Pipe, OpeningAMissingPipeGivesFileNotFound) {
-  WideString name = PipeName("absent");
+TEST(Overlapped, ReadPendsUntilDataAndDataWaitingCompletesAtOnce) {
+  Connection pipe;
+  Overlapped read;
+  char buffer[64] = {};
+  DWORD bytes = 12345;
+  ASSERT_EQ(StartRead(pipe.server.Get(), read, buffer, sizeof(buffer)), ERROR_IO_PENDING);
+  EXPECT_EQ(read.record.Internal, STATUS_PENDING);
+  EXPECT_FALSE(read.Signalled());
   SetLastError(0);
-  Handle client = OpenClient(name);
-  EXPECT_FALSE(client);
-  EXPECT_EQ(GetLastError(), ERROR_FILE_NOT_FOUND);
+  EXPECT_FALSE(GetOverlappedResult(pipe.server.Get(), read.Get(), &bytes, FALSE));
+  EXPECT_EQ(GetLastError(), ERROR_IO_INCOMPLETE);
+  ASSERT_TRUE(WriteMessage(pipe.client.Get(), "hello"));
+  ASSERT_EQ(WaitForSingleObject(read.event.Get(), kGuardMs), WAIT_OBJECT_0);
+  bytes = 0;
+  ASSERT_TRUE(GetOverlappedResult(pipe.server.Get(), read.Get(), &bytes, FALSE));
+  EXPECT_EQ(bytes, 5u);
+  EXPECT_EQ(read.record.InternalHigh, 5u);
+  EXPECT_EQ(std::string(buffer, bytes), "hello");
+
+  // Data already waiting: done at once, and the event is signalled as well.
+  ASSERT_TRUE(WriteMessage(pipe.client.Get(), "ready"));
+  Overlapped ready;
+  ASSERT_EQ(StartRead(pipe.server.Get(), ready, buffer, sizeof(buffer)), 0u);
+  EXPECT_TRUE(ready.Signalled());
+  ASSERT_TRUE(GetOverlappedResult(pipe.server.Get(), ready.Get(), &bytes, FALSE));
+  EXPECT_EQ(std::string(buffer, bytes), "ready");
+
+  // Asked to wait, GetOverlappedResult returns only with the completion.
+  Handle go = NewEvent(true, false);
+  Thread writer([&]() -> DWORD {
+    if (WaitForSingleObject(go.Get(), kGuardMs) != WAIT_OBJECT_0) return 1;
+    return WriteMessage(pipe.client.Get(), "late data") ? 0 : 2;
+  });
+  Overlapped late;
+  ASSERT_EQ(StartRead(pipe.server.Get(), late, buffer, sizeof(buffer)), ERROR_IO_PENDING);
+  ASSERT_TRUE(SetEvent(go.Get()));
+  ASSERT_TRUE(GetOverlappedResult(pipe.server.Get(), late.Get(), &bytes, TRUE));
+  EXPECT_EQ(std::string(buffer, bytes), "late data");
+  EXPECT_EQ(writer.Join(), 0u);
 }
 
-TEST(Pipe, MessagesKeepTheirBoundariesBothWays) {
-  WideString name = PipeName();
-  Handle server = CreateServer(name);
-  ASSERT_TRUE(server);
-  Handle client = OpenClient(name);
-  ASSERT_TRUE(client);
-  ASSERT_TRUE(WriteMessage(client.Get(), "abc"));
-  ASSERT_TRUE(WriteMessage(client.Get(), "defgh"));
-  std::string text;
-  ASSERT_EQ(ReadServer(server.Get(), text), 0u);
-  EXPECT_EQ(text, "abc");
-  ASSERT_EQ(ReadServer(server.Get(), text), 0u);
-  EXPECT_EQ(text, "defgh");
+TEST(Overlapped, HandleOpenedWithoutOverlappedCompletesSynchronously) {
+  Connection pipe;
+  // A blocking read on the synchronous client returns only with the data.
+  Thread reader([&]() -> DWORD {
+    char buffer[64] = {};
+    DWORD bytes = 0;
+    return ReadFile(pipe.client.Get(), buffer, sizeof(buffer), &bytes, nullptr) ? bytes : 0xFFFF;
+  });
+  ASSERT_TRUE(WriteOverlapped(pipe.server.Get(), "reply!"));
+  EXPECT_EQ(reader.Join(), 6u);
+  // An OVERLAPPED record without an event on a synchronous handle is simply
+  // filled in as the call returns.
+  ASSERT_TRUE(WriteOverlapped(pipe.server.Get(), "abc"));
+  OVERLAPPED plain{};
+  char buffer[16] = {};
+  DWORD bytes = 0;
+  ASSERT_TRUE(ReadFile(pipe.client.Get(), buffer, sizeof(buffer), &bytes, &plain));
+  EXPECT_EQ(std::string(buffer, bytes), "abc");
+}
 
+// CancelIo aborts the calling thread's pending read and leaves another
+// thread's read on the same handle pending; the handle stays usable.
+TEST(Overlapped, CancelIoAbortsOnlyTheCallingThreadsRequests) {
+  Connection pipe;
+  EXPECT_TRUE(CancelIo(pipe.server.Get()));  // nothing pending: still success
+  Handle issued = NewEvent(true, false);
+  Overlapped other;
+  char otherBuffer[64] = {};
+  // The thread stays alive until its request is done (Windows also cancels a
+  // thread's requests when it ends).
+  Thread thread([&]() -> DWORD {
+    DWORD error = StartRead(pipe.server.Get(), other, otherBuffer, sizeof(otherBuffer));
+    if (error != ERROR_IO_PENDING) return 0xF000 + error;
+    SetEvent(issued.Get());
+    DWORD bytes = 0;
+    return GetOverlappedResult(pipe.server.Get(), other.Get(), &bytes, TRUE)
+               ? bytes
+               : 0xE000 + GetLastError();
+  });
+  ASSERT_EQ(WaitForSingleObject(issued.Get(), kGuardMs), WAIT_OBJECT_0);
+
+  Overlapped mine;
+  char buffer[64] = {};
+  DWORD bytes = 77;
+  ASSERT_EQ(StartRead(pipe.server.Get(), mine, buffer, sizeof(buffer)), ERROR_IO_PENDING);
+  ASSERT_TRUE(CancelIo(pipe.server.Get()));
+  ASSERT_EQ(WaitForSingleObject(mine.event.Get(), kGuardMs), WAIT_OBJECT_0);
+  SetLastError(0);
+  EXPECT_FALSE(GetOverlappedResult(pipe.server.Get(), mine.Get(), &bytes, TRUE));
+  EXPECT_EQ(GetLastError(), ERROR_OPERATION_ABORTED);
+  EXPECT_EQ(bytes, 0u);
+  EXPECT_NE(mine.record.Internal, STATUS_PENDING);
+
+  EXPECT_FALSE(other.Signalled());
+  EXPECT_EQ(other.record.Internal, STATUS_PENDING);
+  ASSERT_TRUE(WriteMessage(pipe.client.Get(), "for the other"));
+  EXPECT_EQ(thread.Join(), 13u);
+  EXPECT_EQ(std::string(otherBuffer, 13), "for the other");
+
+  ASSERT_TRUE(WriteMessage(pipe.client.Get(), "after"));
+  std::string text;
+  ASSERT_EQ(ReadServer(pipe.server.Get(), text), 0u);
+  EXPECT_EQ(text, "after");
+}
+
+TEST(Pipe, MessagesKeepTheirBoundariesBothWaysEvenWhenEmpty) {
+  Connection pipe;
+  DWORD written = 99;
+  ASSERT_TRUE(WriteMessage(pipe.client.Get(), "abc"));
+  ASSERT_TRUE(WriteFile(pipe.client.Get(), "", 0, &written, nullptr));
+  EXPECT_EQ(written, 0u);
+  ASSERT_TRUE(WriteMessage(pipe.client.Get(), "defgh"));
+  std::string text;
+  for (const char* expected : {"abc", "", "defgh"}) {
+    text = "unchanged";
+    ASSERT_EQ(ReadServer(pipe.server.Get(), text), 0u);
+    EXPECT_EQ(text, expected);
+  }
   // Replies: the client switched to message read mode sees them one by one.
   DWORD mode = PIPE_READMODE_MESSAGE;
-  ASSERT_TRUE(SetNamedPipeHandleState(client.Get(), &mode, nullptr, nullptr));
-  ASSERT_TRUE(WriteOverlapped(server.Get(), "one"));
-  ASSERT_TRUE(WriteOverlapped(server.Get(), "three"));
+  ASSERT_TRUE(SetNamedPipeHandleState(pipe.client.Get(), &mode, nullptr, nullptr));
+  ASSERT_TRUE(WriteOverlapped(pipe.server.Get(), "one"));
+  ASSERT_TRUE(WriteOverlapped(pipe.server.Get(), "three"));
   char buffer[64] = {};
   DWORD bytes = 0;
-  ASSERT_TRUE(ReadFile(client.Get(), buffer, sizeof(buffer), &bytes, nullptr));
-  EXPECT_EQ(std::string(buffer, bytes), "one");
-  ASSERT_TRUE(ReadFile(client.Get(), buffer, sizeof(buffer), &bytes, nullptr));
-  EXPECT_EQ(std::string(buffer, bytes), "three");
+  for (const char* expected : {"one", "three"}) {
+    ASSERT_TRUE(ReadFile(pipe.client.Get(), buffer, sizeof(buffer), &bytes, nullptr));
+    EXPECT_EQ(std::string(buffer, bytes), expected);
+  }
 }
 
-TEST(Pipe, ZeroLengthMessageReadsAsZeroBytes) {
-  WideString name = PipeName();
-  Handle server = CreateServer(name);
-  ASSERT_TRUE(server);
-  Handle client = OpenClient(name);
-  ASSERT_TRUE(client);
-  DWORD written = 99;
-  ASSERT_TRUE(WriteFile(client.Get(), "", 0, &written, nullptr));
-  EXPECT_EQ(written, 0u);
-  ASSERT_TRUE(WriteMessage(client.Get(), "next"));
-  std::string text = "unchanged";
-  ASSERT_EQ(ReadServer(server.Get(), text), 0u);
-  EXPECT_EQ(text, "");
-  ASSERT_EQ(ReadServer(server.Get(), text), 0u);
-  EXPECT_EQ(text, "next");
-}
-
-TEST(Pipe, MessageLongerThanTheBufferGivesMoreData) {
-  WideString name = PipeName();
-  Handle server = CreateServer(name);
-  ASSERT_TRUE(server);
-  Handle client = OpenClient(name);
-  ASSERT_TRUE(client);
+TEST(Pipe, MessageLongerThanTheBufferGivesMoreDataThenTheRest) {
+  Connection pipe;
   std::string message(100, 'x');
   for (size_t i = 0; i < message.size(); ++i) message[i] = static_cast<char>('a' + i % 26);
-
   // Data already waiting: the read returns at once with ERROR_MORE_DATA.
-  ASSERT_TRUE(WriteMessage(client.Get(), message));
+  ASSERT_TRUE(WriteMessage(pipe.client.Get(), message));
   std::string part;
-  EXPECT_EQ(ReadServer(server.Get(), part, 40), ERROR_MORE_DATA);
+  EXPECT_EQ(ReadServer(pipe.server.Get(), part, 40), ERROR_MORE_DATA);
   EXPECT_EQ(part, message.substr(0, 40));
-  EXPECT_EQ(ReadServer(server.Get(), part, 256), 0u);  // the rest of the same message
+  EXPECT_EQ(ReadServer(pipe.server.Get(), part, 256), 0u);  // the rest of the same message
   EXPECT_EQ(part, message.substr(40));
 
   // Read pending first: its completion reports ERROR_MORE_DATA the same way.
   Overlapped read;
   char buffer[40] = {};
   DWORD bytes = 0;
-  ASSERT_FALSE(ReadFile(server.Get(), buffer, sizeof(buffer), &bytes, read.Get()));
-  ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
-  ASSERT_TRUE(WriteMessage(client.Get(), message));
+  ASSERT_EQ(StartRead(pipe.server.Get(), read, buffer, sizeof(buffer)), ERROR_IO_PENDING);
+  ASSERT_TRUE(WriteMessage(pipe.client.Get(), message));
   ASSERT_EQ(WaitForSingleObject(read.event.Get(), kGuardMs), WAIT_OBJECT_0);
   SetLastError(0);
-  EXPECT_FALSE(GetOverlappedResult(server.Get(), read.Get(), &bytes, FALSE));
+  EXPECT_FALSE(GetOverlappedResult(pipe.server.Get(), read.Get(), &bytes, FALSE));
   EXPECT_EQ(GetLastError(), ERROR_MORE_DATA);
   EXPECT_EQ(bytes, 40u);
   EXPECT_EQ(std::string(buffer, 40), message.substr(0, 40));
+  EXPECT_EQ(ReadServer(pipe.server.Get(), part, 256), 0u);
+
+  // A reply longer than the client's buffer, read in message mode.
+  DWORD mode = PIPE_READMODE_MESSAGE;
+  ASSERT_TRUE(SetNamedPipeHandleState(pipe.client.Get(), &mode, nullptr, nullptr));
+  ASSERT_TRUE(WriteOverlapped(pipe.server.Get(), message));
+  SetLastError(0);
+  EXPECT_FALSE(ReadFile(pipe.client.Get(), buffer, sizeof(buffer), &bytes, nullptr));
+  EXPECT_EQ(GetLastError(), ERROR_MORE_DATA);
+  EXPECT_EQ(std::string(buffer, bytes), message.substr(0, 40));
+  char rest[100] = {};
+  ASSERT_TRUE(ReadFile(pipe.client.Get(), rest, sizeof(rest), &bytes, nullptr));
+  EXPECT_EQ(std::string(rest, bytes), message.substr(40));
 }
 
-TEST(Pipe, SixteenthClientOfFifteenInstancesIsBusy) {
+TEST(Pipe, InstanceLimitMakesClientsAndNewInstancesBusy) {
   WideString name = PipeName();
   constexpr int kInstances = 15;
   std::vector<Handle> servers;
   std::vector<Handle> clients;
   for (int i = 0; i < kInstances; ++i) {
-    servers.push_back(CreateServer(name));
+    servers.push_back(CreateServer(name, kInstances));
     ASSERT_TRUE(servers.back()) << "instance " << i;
     Overlapped connect;
     ASSERT_EQ(ConnectOverlapped(servers.back().Get(), connect), ERROR_IO_PENDING);
     clients.push_back(OpenClient(name));
     ASSERT_TRUE(clients.back()) << "client " << i;
   }
+  SetLastError(0);
+  EXPECT_FALSE(CreateServer(name, kInstances));
+  EXPECT_EQ(GetLastError(), ERROR_PIPE_BUSY);
   SetLastError(0);
   Handle sixteenth = OpenClient(name);
   EXPECT_FALSE(sixteenth);
@@ -207,56 +349,35 @@ TEST(Pipe, SixteenthClientOfFifteenInstancesIsBusy) {
   EXPECT_EQ(text, "late");
 }
 
-TEST(Pipe, InstanceLimitRefusesAnotherInstance) {
-  WideString name = PipeName();
-  Handle first = CreateServer(name, 2);
-  Handle second = CreateServer(name, 2);
-  ASSERT_TRUE(first && second);
-  SetLastError(0);
-  Handle third = CreateServer(name, 2);
-  EXPECT_FALSE(third);
-  EXPECT_EQ(GetLastError(), ERROR_PIPE_BUSY);
-}
-
 TEST(Pipe, FirstPipeInstanceFlagRefusesAnExistingName) {
   SKIP_ON_WINE("Wine 8 ignores FILE_FLAG_FIRST_PIPE_INSTANCE and creates the second instance");
   WideString name = PipeName();
   Handle first = CreateServer(name, 16, FILE_FLAG_FIRST_PIPE_INSTANCE);
   ASSERT_TRUE(first);
   SetLastError(0);
-  Handle again = CreateServer(name, 16, FILE_FLAG_FIRST_PIPE_INSTANCE);
-  EXPECT_FALSE(again);
+  EXPECT_FALSE(CreateServer(name, 16, FILE_FLAG_FIRST_PIPE_INSTANCE));
   EXPECT_EQ(GetLastError(), ERROR_ACCESS_DENIED);
-  Handle plain = CreateServer(name);
-  EXPECT_TRUE(plain);
+  EXPECT_TRUE(CreateServer(name));
 }
 
-TEST(Pipe, ClientClosingBreaksTheServersReads) {
-  WideString name = PipeName();
-  Handle server = CreateServer(name);
-  ASSERT_TRUE(server);
-  Handle client = OpenClient(name);
-  ASSERT_TRUE(client);
-
+TEST(Pipe, ClientClosingBreaksAPendingServerRead) {
+  Connection pipe;
   Overlapped read;
   char buffer[64] = {};
   DWORD bytes = 0;
-  ASSERT_FALSE(ReadFile(server.Get(), buffer, sizeof(buffer), &bytes, read.Get()));
-  ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
-  client.Reset();
+  ASSERT_EQ(StartRead(pipe.server.Get(), read, buffer, sizeof(buffer)), ERROR_IO_PENDING);
+  pipe.client.Reset();
   ASSERT_EQ(WaitForSingleObject(read.event.Get(), kGuardMs), WAIT_OBJECT_0);
   SetLastError(0);
-  EXPECT_FALSE(GetOverlappedResult(server.Get(), read.Get(), &bytes, FALSE));
+  EXPECT_FALSE(GetOverlappedResult(pipe.server.Get(), read.Get(), &bytes, FALSE));
   EXPECT_EQ(GetLastError(), ERROR_BROKEN_PIPE);
-
-  // Later reads fail at once the same way.
   std::string text;
-  EXPECT_EQ(ReadServer(server.Get(), text), ERROR_BROKEN_PIPE);
+  EXPECT_EQ(ReadServer(pipe.server.Get(), text), ERROR_BROKEN_PIPE);  // and later reads at once
 }
 
 // A client process that ends without closing its handle: the system closes
-// it, what it wrote is still read, a pending read breaks and a write finds
-// the pipe closing.
+// it, what it wrote is still read, a read breaks and a write finds the pipe
+// closing.
 TEST(Pipe, ClientProcessEndingClosesItsEnd) {
   WideString name = PipeName();
   if (skytest::ChildRole() != nullptr) {
@@ -269,8 +390,7 @@ TEST(Pipe, ClientProcessEndingClosesItsEnd) {
   Handle server = CreateServer(name);
   ASSERT_TRUE(server);
   Overlapped connect;
-  ASSERT_FALSE(ConnectNamedPipe(server.Get(), connect.Get()));
-  ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
+  ASSERT_EQ(ConnectOverlapped(server.Get(), connect), ERROR_IO_PENDING);
   skytest::ChildProcess child;
   ASSERT_TRUE(child.Start("client"));
   DWORD bytes = 0;
@@ -278,12 +398,9 @@ TEST(Pipe, ClientProcessEndingClosesItsEnd) {
   std::string text;
   EXPECT_EQ(ReadServer(server.Get(), text), 0u);
   EXPECT_EQ(text, "last words");
-
   Overlapped read;
   char buffer[64] = {};
-  SetLastError(0);
-  EXPECT_FALSE(ReadFile(server.Get(), buffer, sizeof(buffer), &bytes, read.Get()));
-  DWORD error = GetLastError();
+  DWORD error = StartRead(server.Get(), read, buffer, sizeof(buffer));
   ASSERT_EQ(child.Wait(skytest::kProcessGuardMs), 0);
   if (error == ERROR_IO_PENDING) {
     EXPECT_FALSE(GetOverlappedResult(server.Get(), read.Get(), &bytes, TRUE));
@@ -299,100 +416,29 @@ TEST(Pipe, ClientProcessEndingClosesItsEnd) {
 
 TEST(Pipe, ServerDisconnectEndsTheClientAndTheInstanceServesTheNext) {
   WideString name = PipeName();
-  Handle server = CreateServer(name);
-  ASSERT_TRUE(server);
-  Handle first = OpenClient(name);
-  ASSERT_TRUE(first);
-  ASSERT_TRUE(WriteMessage(first.Get(), "one"));
-  ASSERT_TRUE(DisconnectNamedPipe(server.Get()));
-
-  // The disconnected client can neither read nor write any more.
+  Connection pipe(name);
+  ASSERT_TRUE(WriteMessage(pipe.client.Get(), "one"));
+  ASSERT_TRUE(DisconnectNamedPipe(pipe.server.Get()));
   char buffer[16] = {};
   DWORD bytes = 0;
   SetLastError(0);
-  EXPECT_FALSE(ReadFile(first.Get(), buffer, sizeof(buffer), &bytes, nullptr));
+  EXPECT_FALSE(ReadFile(pipe.client.Get(), buffer, sizeof(buffer), &bytes, nullptr));
   EXPECT_EQ(GetLastError(), ERROR_PIPE_NOT_CONNECTED);
   SetLastError(0);
-  EXPECT_FALSE(WriteMessage(first.Get(), "more"));
+  EXPECT_FALSE(WriteMessage(pipe.client.Get(), "more"));
   EXPECT_EQ(GetLastError(), ERROR_PIPE_NOT_CONNECTED);
 
   // The instance listens again and serves a new client; the first client's
   // unread message went with its connection.
   Overlapped connect;
-  ASSERT_EQ(ConnectOverlapped(server.Get(), connect), ERROR_IO_PENDING);
+  ASSERT_EQ(ConnectOverlapped(pipe.server.Get(), connect), ERROR_IO_PENDING);
   Handle second = OpenClient(name);
   ASSERT_TRUE(second);
   ASSERT_EQ(WaitForSingleObject(connect.event.Get(), kGuardMs), WAIT_OBJECT_0);
   ASSERT_TRUE(WriteMessage(second.Get(), "two"));
   std::string text;
-  ASSERT_EQ(ReadServer(server.Get(), text), 0u);
+  ASSERT_EQ(ReadServer(pipe.server.Get(), text), 0u);
   EXPECT_EQ(text, "two");
-}
-
-TEST(Pipe, WaitNamedPipeSeesAListeningInstance) {
-  WideString name = PipeName();
-  SetLastError(0);
-  EXPECT_FALSE(WaitNamedPipeW(name.c_str(), 1));
-  EXPECT_EQ(GetLastError(), ERROR_FILE_NOT_FOUND);
-
-  Handle server = CreateServer(name);
-  ASSERT_TRUE(server);
-  Overlapped connect;
-  ASSERT_EQ(ConnectOverlapped(server.Get(), connect), ERROR_IO_PENDING);
-  EXPECT_TRUE(WaitNamedPipeW(name.c_str(), kGuardMs));
-  Handle client = OpenClient(name);
-  EXPECT_TRUE(client);
-}
-
-// Answers one request: reads it and writes back "re:" + request.
-struct Echo {
-  HANDLE server = nullptr;
-  std::string reply;
-};
-
-DWORD WINAPI EchoOnce(LPVOID parameter) {
-  auto* echo = static_cast<Echo*>(parameter);
-  std::string request;
-  if (ReadServer(echo->server, request) != 0) return 1;
-  std::string reply = echo->reply.empty() ? "re:" + request : echo->reply;
-  return WriteOverlapped(echo->server, reply) ? 0 : 2;
-}
-
-TEST(Pipe, TransactNamedPipeWritesTheRequestAndReadsTheReply) {
-  WideString name = PipeName();
-  Handle server = CreateServer(name);
-  ASSERT_TRUE(server);
-  Handle client = OpenClient(name);
-  ASSERT_TRUE(client);
-  DWORD mode = PIPE_READMODE_MESSAGE;
-  ASSERT_TRUE(SetNamedPipeHandleState(client.Get(), &mode, nullptr, nullptr));
-
-  for (const char* forcedReply : {"", "ABCDEFGHIJKLMNOPQRSTUVWX"}) {
-    Echo echo{server.Get(), forcedReply};
-    Handle thread(CreateThread(nullptr, 0, EchoOnce, &echo, 0, nullptr));
-    ASSERT_TRUE(thread);
-    char reply[16] = {};
-    DWORD bytes = 0;
-    SetLastError(0);
-    BOOL done = TransactNamedPipe(client.Get(), const_cast<char*>("status?"), 7, reply,
-                                  sizeof(reply), &bytes, nullptr);
-    if (echo.reply.empty()) {
-      ASSERT_TRUE(done) << GetLastError();
-      EXPECT_EQ(std::string(reply, bytes), "re:status?");
-    } else {
-      // A reply longer than the buffer: the start of it and ERROR_MORE_DATA.
-      EXPECT_FALSE(done);
-      EXPECT_EQ(GetLastError(), ERROR_MORE_DATA);
-      EXPECT_EQ(bytes, sizeof(reply));
-      EXPECT_EQ(std::string(reply, bytes), echo.reply.substr(0, sizeof(reply)));
-      ASSERT_TRUE(ReadFile(client.Get(), reply, sizeof(reply), &bytes, nullptr));
-      EXPECT_EQ(std::string(reply, bytes), echo.reply.substr(sizeof(reply)));
-    }
-    ASSERT_EQ(WaitForSingleObject(thread.Get(), kGuardMs), WAIT_OBJECT_0);
-    DWORD code = 99;
-    ASSERT_TRUE(GetExitCodeThread(thread.Get(), &code));
-    EXPECT_EQ(code, 0u);
-  }
 }
 
 }  // namespace

@@ -1,17 +1,22 @@
-// Named pipes between processes: the server's overlapped requests finish
-// when a client in another process acts (the I/O service thread of the
-// server's process completes them), and an end whose process dies counts
-// as closed. The other process is this test program started again.
+// Named pipes between processes and pipe lifetimes: an end whose process dies
+// at any moment (even inside the kernel lock) counts as closed and the server
+// goes on; a dead server's pipe is gone; closing a server ends its pending
+// connect; a request outlives the event handle its caller closed. The other
+// process is this test program started again.
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <cstring>
+#include <string>
 
-#include "child_body.h"
 #include "platform/posix/kernel.h"
 #include "platform/win32.h"
+#include "support/child_process.h"
+#include "support/test_support.h"
 
 namespace {
+
+using skytest::RunAsChild;
 
 constexpr const char16_t* kPipe = u"\\\\.\\pipe\\EmuCrossProcessPipe";
 
@@ -21,22 +26,23 @@ HANDLE CreateServer() {
                           5000, nullptr);
 }
 
-// Synchronous client: one request, one reply, then close.
+HANDLE OpenClient() {
+  return CreateFileW(kPipe, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr);
+}
+
+// Synchronous client process: one request, one reply, then close.
 int ClientExchange() {
   if (!WaitNamedPipeW(kPipe, NMPWAIT_WAIT_FOREVER)) return 20;
-  HANDLE pipe =
-      CreateFileW(kPipe, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr);
+  HANDLE pipe = OpenClient();
   if (pipe == INVALID_HANDLE_VALUE) return 21;
   DWORD mode = PIPE_READMODE_MESSAGE;
   if (!SetNamedPipeHandleState(pipe, &mode, nullptr, nullptr)) return 22;
   char reply[16] = {};
   DWORD bytes = 0;
-  if (!TransactNamedPipe(pipe, const_cast<char*>("ping"), 4, reply, sizeof(reply), &bytes,
-                         nullptr)) {
-    return 23;
-  }
-  if (bytes != 5 || std::memcmp(reply, "pong!", 5) != 0) return 24;
-  return CloseHandle(pipe) ? 0 : 25;
+  if (!WriteFile(pipe, "ping", 4, &bytes, nullptr)) return 23;
+  if (!ReadFile(pipe, reply, sizeof(reply), &bytes, nullptr)) return 24;
+  if (bytes != 5 || std::memcmp(reply, "pong!", 5) != 0) return 25;
+  return CloseHandle(pipe) ? 0 : 26;
 }
 
 // Waits for the overlapped request on `ov` to finish; its result and count.
@@ -46,55 +52,38 @@ bool Finish(HANDLE server, OVERLAPPED* ov, BOOL started, DWORD* bytes) {
   return GetOverlappedResult(server, ov, bytes, FALSE) != FALSE;
 }
 
-// Serves one client process's "ping" with "pong!" on a listening instance;
-// the next read then finds the pipe broken. The case must call
+// Serves one client process's "ping" with "pong!" on a listening instance
+// (the server's overlapped requests are completed by the other process's
+// actions); the next read then finds the pipe broken. The case must call
 // RunAsChild("exchange", ClientExchange) first.
 void ServeOneExchange(HANDLE server, OVERLAPPED* ov) {
   skytest::ChildProcess child;
   ASSERT_TRUE(child.Start("exchange"));
   DWORD bytes = 0;
   BOOL connected = ConnectNamedPipe(server, ov);
-  if (!connected && GetLastError() == ERROR_PIPE_CONNECTED) {
-    connected = TRUE;
-  } else {
+  if (connected || GetLastError() != ERROR_PIPE_CONNECTED) {
     ASSERT_TRUE(Finish(server, ov, connected, &bytes));
   }
   char request[16] = {};
   ASSERT_TRUE(Finish(server, ov, ReadFile(server, request, sizeof(request), &bytes, ov), &bytes));
-  EXPECT_EQ(bytes, 4u);
-  EXPECT_EQ(std::memcmp(request, "ping", 4), 0);
+  EXPECT_EQ(std::string(request, bytes), "ping");
   ASSERT_TRUE(Finish(server, ov, WriteFile(server, "pong!", 5, &bytes, ov), &bytes));
-  EXPECT_EQ(bytes, 5u);
   EXPECT_EQ(child.Wait(skytest::kProcessGuardMs), 0);
   EXPECT_FALSE(Finish(server, ov, ReadFile(server, request, sizeof(request), &bytes, ov), &bytes));
   EXPECT_EQ(GetLastError(), ERROR_BROKEN_PIPE);
   EXPECT_TRUE(DisconnectNamedPipe(server));
 }
 
-TEST(PipeProcesses, OverlappedServerIsCompletedByAClientProcess) {
-  RunAsChild("exchange", ClientExchange);
-  HANDLE server = CreateServer();
-  ASSERT_NE(server, INVALID_HANDLE_VALUE);
-  HANDLE event = CreateEventW(nullptr, TRUE, FALSE, nullptr);
-  OVERLAPPED ov{};
-  ov.hEvent = event;
-  ServeOneExchange(server, &ov);
-  ServeOneExchange(server, &ov);
-  CloseHandle(event);
-  CloseHandle(server);
-}
-
-// A client process killed at any moment, even inside the kernel lock, leaves
-// the server's process working as on Windows: its pipe end is closed (the
-// pending read breaks), a mutex it owned is abandoned, a change it left
-// half made is undone, and the instance serves the next client.
+// A client process killed at any moment leaves the server's process working
+// as on Windows: its pipe end is closed (the pending read breaks), a mutex it
+// owned is abandoned, a change it left half made is undone, and the instance
+// serves the next client.
 enum class KillPoint { kInWrite, kInRead, kInWait, kOwningMutex, kInsideKernelLock };
 
 class KilledClient : public ::testing::TestWithParam<KillPoint> {};
 
 int ClientUntilKilled(KillPoint point) {
-  HANDLE pipe =
-      CreateFileW(kPipe, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr);
+  HANDLE pipe = OpenClient();
   HANDLE up = OpenEventW(EVENT_MODIFY_STATE, FALSE, u"Global\\EmuKillUp");
   HANDLE idle = OpenEventW(SYNCHRONIZE | EVENT_MODIFY_STATE, FALSE, u"Global\\EmuKillIdle");
   HANDLE mutex = OpenMutexW(SYNCHRONIZE | MUTEX_MODIFY_STATE, FALSE, u"Global\\EmuKillMutex");
@@ -165,6 +154,7 @@ TEST_P(KilledClient, ServerProcessGoesOn) {
   EXPECT_EQ(WaitForSingleObject(idle, 0), WAIT_TIMEOUT);
   EXPECT_TRUE(DisconnectNamedPipe(server));
   ServeOneExchange(server, &ov);
+  ServeOneExchange(server, &ov);
   for (HANDLE h : {event, mutex, idle, up, server}) CloseHandle(h);
 }
 
@@ -181,24 +171,50 @@ TEST(PipeProcesses, KilledServerBreaksTheClientAndRemovesThePipe) {
     SetEvent(ready);
     for (;;) pause();
   });
-  HANDLE up = CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuPipeServerUp"));
+  skytest::Handle up(CreateEventW(nullptr, TRUE, FALSE, WSTR("Global\\EmuPipeServerUp")));
   skytest::ChildProcess child;
   ASSERT_TRUE(child.Start("server"));
-  ASSERT_EQ(WaitForSingleObject(up, 10000), WAIT_OBJECT_0);
-  HANDLE client =
-      CreateFileW(kPipe, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr);
-  ASSERT_NE(client, INVALID_HANDLE_VALUE);
+  ASSERT_EQ(WaitForSingleObject(up.Get(), 10000), WAIT_OBJECT_0);
+  skytest::Handle client(OpenClient());
+  ASSERT_TRUE(client);
   child.Kill();
   EXPECT_EQ(child.Wait(skytest::kProcessGuardMs), 128 + 9);
   char buffer[8];
   DWORD bytes = 0;
-  EXPECT_FALSE(ReadFile(client, buffer, sizeof(buffer), &bytes, nullptr));
+  EXPECT_FALSE(ReadFile(client.Get(), buffer, sizeof(buffer), &bytes, nullptr));
   EXPECT_EQ(GetLastError(), ERROR_BROKEN_PIPE);
-  CloseHandle(client);
-  EXPECT_EQ(CreateFileW(kPipe, GENERIC_READ, 0, nullptr, OPEN_EXISTING, 0, nullptr),
-            INVALID_HANDLE_VALUE);
+  client.Reset();
+  EXPECT_EQ(OpenClient(), INVALID_HANDLE_VALUE);
   EXPECT_EQ(GetLastError(), ERROR_FILE_NOT_FOUND);
-  CloseHandle(up);
+}
+
+// Closing a server instance ends its pending connect (as the service's stop
+// does), and a request keeps its event object alive after the caller closed
+// the handle; finishing it then drops the last reference inside the emulation.
+TEST(PipeLifetime, ClosingEndsAPendingConnectAndAPendingReadOutlivesItsEvent) {
+  HANDLE server = CreateServer();
+  OVERLAPPED ov{};
+  ov.hEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+  EXPECT_FALSE(ConnectNamedPipe(server, &ov));
+  EXPECT_EQ(GetLastError(), ERROR_IO_PENDING);
+  CloseHandle(server);
+  EXPECT_EQ(WaitForSingleObject(ov.hEvent, 10000), WAIT_OBJECT_0);
+  EXPECT_EQ(ov.Internal, 0xC0000120u);  // STATUS_CANCELLED
+
+  server = CreateServer();
+  HANDLE client = OpenClient();
+  char buffer[8];
+  ResetEvent(ov.hEvent);
+  EXPECT_FALSE(ReadFile(server, buffer, sizeof(buffer), nullptr, &ov));
+  ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
+  CloseHandle(ov.hEvent);
+  DWORD bytes = 0;
+  EXPECT_TRUE(WriteFile(client, "late", 4, &bytes, nullptr));
+  ov.hEvent = nullptr;  // wait on the file instead
+  EXPECT_TRUE(GetOverlappedResult(server, &ov, &bytes, TRUE));
+  EXPECT_EQ(bytes, 4u);
+  CloseHandle(client);
+  CloseHandle(server);
 }
 
 }  // namespace

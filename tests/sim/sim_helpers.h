@@ -1,6 +1,6 @@
-// Helpers of the simulation tests: a machine installed for one case, device
-// lists read through SetupAPI, and pass-through requests as the service
-// builds them.
+// Helpers of the simulation tests: a default machine installed for one case
+// (its device events recorded), device lists read through SetupAPI, and
+// pass-through requests as the service builds them.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -25,31 +25,37 @@ struct PassThroughRequest {
   UCHAR sense[20];
 };
 static_assert(sizeof(PassThroughRequest) == 80);
-static_assert(offsetof(PassThroughRequest, totalLength) == 56);
-static_assert(offsetof(PassThroughRequest, sense) == 60);
 
-inline PassThroughRequest MakeRequest(std::initializer_list<UCHAR> cdb, void* buffer, ULONG length,
-                                      UCHAR direction = SCSI_IOCTL_DATA_IN) {
+// An INQUIRY of 74 bytes into `data`.
+inline PassThroughRequest Inquiry(std::uint8_t (&data)[74]) {
   PassThroughRequest r{};
   r.sptd.Length = sizeof(SCSI_PASS_THROUGH_DIRECT);
-  r.sptd.CdbLength = static_cast<UCHAR>(cdb.size());
+  r.sptd.CdbLength = 6;
   r.sptd.SenseInfoLength = 18;
-  r.sptd.DataIn = direction;
-  r.sptd.DataTransferLength = length;
+  r.sptd.DataIn = SCSI_IOCTL_DATA_IN;
+  r.sptd.DataTransferLength = sizeof data;
   r.sptd.TimeOutValue = 20;
-  r.sptd.DataBuffer = buffer;
+  r.sptd.DataBuffer = data;
   r.sptd.SenseInfoOffset = 60;
-  std::size_t i = 0;
-  for (UCHAR b : cdb) r.sptd.Cdb[i++] = b;
+  r.sptd.Cdb[0] = 0x12;
+  r.sptd.Cdb[4] = sizeof data;
   r.totalLength = 80;
   return r;
 }
 
-// Sends a pass-through command on a synchronous handle.
-inline bool Scsi(HANDLE device, PassThroughRequest* request) {
+// Sends a pass-through command, synchronously unless `overlapped` is given.
+inline bool Scsi(HANDLE device, PassThroughRequest* request, OVERLAPPED* overlapped = nullptr) {
   DWORD bytes = 0;
   return DeviceIoControl(device, IOCTL_SCSI_PASS_THROUGH_DIRECT, request, sizeof *request, request,
-                         sizeof *request, &bytes, nullptr) != FALSE;
+                         sizeof *request, &bytes, overlapped) != FALSE;
+}
+
+inline std::string Text(const WCHAR* text) {
+  return WideToUtf8(WideView(text));
+}
+
+inline bool Contains(const std::string& text, const std::string& part) {
+  return text.find(part) != std::string::npos;
 }
 
 struct Found {
@@ -57,10 +63,6 @@ struct Found {
   DEVINST devInst = 0;
   std::string instanceId;
 };
-
-inline std::string Text(const WCHAR* text) {
-  return WideToUtf8(WideView(text));
-}
 
 // Every interface of a class, read as the service reads it (size query,
 // then the detail and the device's instance ID).
@@ -94,59 +96,23 @@ inline std::vector<Found> ListInterfaces(const GUID& interfaceClass) {
   return found;
 }
 
-inline std::string DeviceId(DEVINST node) {
-  WCHAR id[MAX_DEVICE_ID_LEN + 1] = {};
-  EXPECT_EQ(CM_Get_Device_IDW(node, id, MAX_DEVICE_ID_LEN + 1, 0), CR_SUCCESS);
-  return Text(id);
-}
-
-inline DEVINST ParentOf(DEVINST node) {
-  DEVINST parent = 0;
-  EXPECT_EQ(CM_Get_Parent(&parent, node, 0), CR_SUCCESS);
-  return parent;
-}
-
-inline std::string NodeText(DEVINST node, ULONG property) {
-  WCHAR text[256] = {};
-  ULONG length = sizeof text;
-  if (CM_Get_DevNode_Registry_PropertyW(node, property, nullptr, text, &length, 0) != CR_SUCCESS) {
-    return "<none>";
-  }
-  return Text(text);
-}
-
-inline bool Contains(const std::string& text, const std::string& part) {
-  return text.find(part) != std::string::npos;
-}
-
-inline HANDLE OpenDevice(const std::string& path, bool overlapped = true,
-                         DWORD access = GENERIC_READ | GENERIC_WRITE) {
+inline HANDLE OpenDevice(const std::string& path, bool overlapped = true) {
   WideString wide = Utf8ToWide(path);
-  return CreateFileW(wide.c_str(), access, FILE_SHARE_READ | FILE_SHARE_WRITE, nullptr,
-                     OPEN_EXISTING, overlapped ? FILE_FLAG_OVERLAPPED : 0, nullptr);
+  return CreateFileW(wide.c_str(), GENERIC_READ | GENERIC_WRITE, FILE_SHARE_READ | FILE_SHARE_WRITE,
+                     nullptr, OPEN_EXISTING, overlapped ? FILE_FLAG_OVERLAPPED : 0, nullptr);
 }
 
-// A control on a synchronous handle; false with the error in *error.
-inline bool Control(HANDLE device, DWORD code, void* in, DWORD inLength, void* out, DWORD outLength,
-                    DWORD* bytes = nullptr, DWORD* error = nullptr) {
-  DWORD count = 0;
-  BOOL ok = DeviceIoControl(device, code, in, inLength, out, outLength, &count, nullptr);
-  if (bytes != nullptr) *bytes = count;
-  if (error != nullptr) *error = ok ? ERROR_SUCCESS : GetLastError();
-  return ok != FALSE;
-}
-
-// Finds the disk interface whose path contains `part`.
-inline Found DiskWith(const std::string& part) {
-  for (const Found& f : ListInterfaces(GUID_DEVINTERFACE_DISK)) {
-    if (Contains(f.path, part) || Contains(f.instanceId, part)) return f;
+// The path of the first interface of a class whose path contains `part`.
+inline std::string PathWith(const GUID& interfaceClass, const std::string& part = "") {
+  for (const Found& f : ListInterfaces(interfaceClass)) {
+    if (Contains(f.path, part)) return f.path;
   }
-  ADD_FAILURE() << "no disk with " << part;
+  ADD_FAILURE() << "no interface with " << part;
   return {};
 }
 
 // A machine built from the embedded default description, installed for the
-// test case; events go to a list instead of the service manager.
+// test case; device events go to a list instead of the service manager.
 class DefaultMachineTest : public ::testing::Test {
  protected:
   void SetUp() override {

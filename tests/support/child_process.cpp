@@ -15,9 +15,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <chrono>
-#include <thread>
-
 extern char** environ;
 #endif
 
@@ -103,10 +100,6 @@ int ChildProcess::Wait(DWORD timeoutMs) {
   return result;
 }
 
-ChildProcess::~ChildProcess() {
-  if (Running()) Wait(0);
-}
-
 void ChildProcess::Kill() {
   if (Running()) TerminateProcess(reinterpret_cast<HANDLE>(id_), 128 + 9);
 }
@@ -142,31 +135,17 @@ int ChildProcess::Wait(DWORD timeoutMs) {
   pid_t pid = static_cast<pid_t>(id_);
   id_ = 0;
   int status = 0;
-  bool ended = false;
-  // A pidfd becomes readable when the child ends, which gives a proper
-  // bounded wait; without one, fall back to polling waitpid.
+  // A pidfd (the emulation watches its peers the same way) becomes readable
+  // when the child ends, which gives a bounded wait.
   long pidfd = syscall(SYS_pidfd_open, pid, 0);
-  if (pidfd >= 0) {
-    pollfd entry{static_cast<int>(pidfd), POLLIN, 0};
-    int timeout = timeoutMs == INFINITE ? -1 : static_cast<int>(timeoutMs);
-    int ready = 0;
-    do {
-      ready = poll(&entry, 1, timeout);
-    } while (ready < 0 && errno == EINTR);
-    close(static_cast<int>(pidfd));
-    ended = ready > 0 && waitpid(pid, &status, 0) == pid;
-  } else {
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
-    for (;;) {
-      pid_t done = waitpid(pid, &status, WNOHANG);
-      if (done == pid) {
-        ended = true;
-        break;
-      }
-      if (done < 0 || std::chrono::steady_clock::now() >= deadline) break;
-      std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    }
-  }
+  pollfd entry{static_cast<int>(pidfd), POLLIN, 0};
+  int ready = 0;
+  do {
+    ready =
+        pidfd < 0 ? -1 : poll(&entry, 1, timeoutMs == INFINITE ? -1 : static_cast<int>(timeoutMs));
+  } while (ready < 0 && errno == EINTR);
+  if (pidfd >= 0) close(static_cast<int>(pidfd));
+  bool ended = ready > 0 && waitpid(pid, &status, 0) == pid;
   if (!ended) {
     kill(pid, SIGKILL);
     waitpid(pid, &status, 0);
@@ -177,15 +156,15 @@ int ChildProcess::Wait(DWORD timeoutMs) {
   return -1;
 }
 
-ChildProcess::~ChildProcess() {
-  if (Running()) Wait(0);
-}
-
 void ChildProcess::Kill() {
   if (Running()) kill(static_cast<pid_t>(id_), SIGKILL);
 }
 
 #endif
+
+ChildProcess::~ChildProcess() {
+  if (Running()) Wait(0);
+}
 
 int RunChildSelf(const char* role, DWORD timeoutMs) {
   ChildProcess child;

@@ -13,6 +13,8 @@
 #pragma once
 
 #include <cstdint>
+#include <cstdlib>
+#include <cstring>
 
 #include "platform/win32.h"
 
@@ -50,5 +52,14 @@ class ChildProcess {
 
 // Start + Wait: the child's exit code, -1 on time-out, -2 if it did not start.
 int RunChildSelf(const char* role, DWORD timeoutMs);
+
+// At the top of a case: in the child of `role`, runs `body` and ends the
+// process with its result, without gtest's checks (a child may end holding
+// handles on purpose, or be killed).
+template <class Body>
+void RunAsChild(const char* role, Body body) {
+  const char* current = ChildRole();
+  if (current != nullptr && std::strcmp(current, role) == 0) std::_Exit(body());
+}
 
 }  // namespace skytest

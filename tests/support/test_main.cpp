@@ -2,14 +2,16 @@
 // emulation namespace and registry store of its own (unless the environment
 // already names them, as for a child started by RunChildSelf), so parallel
 // test programs never see each other's named objects, pipes or registry; it
-// removes the registry at exit (the namespace ends with its last process). Every case is checked for leaked handles and threads.
+// removes the registry at exit (the namespace ends with its last process).
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <cstdlib>
 #include <string>
+#include <thread>
 
 #include "child_process.h"
-#include "leak_check.h"
+#include "platform/diagnostics.h"
 
 #if !defined(_WIN32)
 #include <unistd.h>
@@ -20,46 +22,54 @@
 
 namespace {
 
-#if !defined(_WIN32)
-struct Isolation {
-  std::filesystem::path registryDir;
+// After every case the emulation must hold no live handle or thread of this
+// process. A thread signals its handle before it has quite unwound, so the
+// counts are polled (real time) for a while; a real leak never reaches zero.
+// Listeners see a case's end in reverse order: appended after the printer,
+// this one runs first and its failure is printed with the case.
+class LeakCheck : public ::testing::EmptyTestEventListener {
+ public:
+  void OnTestEnd(const ::testing::TestInfo& /*info*/) override {
+    long handles = platform::LiveHandleCount();
+    long threads = platform::LiveThreadCount();
+    if (handles < 0 || threads < 0) return;  // not known on this platform
+    for (int poll = 0; poll < 2000 && (handles != 0 || threads != 0); ++poll) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(5));
+      handles = platform::LiveHandleCount();
+      threads = platform::LiveThreadCount();
+    }
+    if (handles != 0 || threads != 0) {
+      ADD_FAILURE() << "the case left " << handles << " live handle(s) and " << threads
+                    << " live thread(s) in the emulation";
+    }
+  }
 };
+
+#if !defined(_WIN32)
+std::filesystem::path g_registryDir;
 
 bool IsSet(const char* name) {
   const char* value = std::getenv(name);
   return value != nullptr && *value != '\0';
 }
 
-// The registry store goes into a directory of its own that is only named
-// here: the emulation creates it on the first registry write, so a program
-// that never touches the registry (or ends abnormally before) leaves nothing.
-void Isolate(Isolation& isolation) {
+// The registry store goes into a directory of its own, only named here: the
+// emulation creates it on the first registry write, and it goes at exit (also
+// when a case ends the process through exit()).
+void Isolate() {
   std::random_device random;
   std::string tag = std::to_string(getpid()) + "-" + std::to_string(random() % 1000000);
-  if (!IsSet("SKYVANE_NAMESPACE")) {
-    setenv("SKYVANE_NAMESPACE", ("t" + tag).c_str(), 1);
-  }
-  if (!IsSet("SKYVANE_REGISTRY")) {
-    std::filesystem::path directory;
-    do {
-      directory =
-          std::filesystem::temp_directory_path() /
-          ("skyvane-test-" + std::to_string(getpid()) + "-" + std::to_string(random() % 1000000));
-    } while (std::filesystem::exists(directory));
-    isolation.registryDir = directory;
-    setenv("SKYVANE_REGISTRY", (directory / "registry").c_str(), 1);
-  }
-}
-
-Isolation g_isolation;
-
-// Runs at exit, also when a case ends the process through exit().
-void Release() {
-  const Isolation& isolation = g_isolation;
-  if (!isolation.registryDir.empty()) {
+  if (!IsSet("SKYVANE_NAMESPACE")) setenv("SKYVANE_NAMESPACE", ("t" + tag).c_str(), 1);
+  if (IsSet("SKYVANE_REGISTRY")) return;
+  do {
+    g_registryDir = std::filesystem::temp_directory_path() /
+                    ("skyvane-test-" + tag + "-" + std::to_string(random() % 1000));
+  } while (std::filesystem::exists(g_registryDir));
+  setenv("SKYVANE_REGISTRY", (g_registryDir / "registry").c_str(), 1);
+  std::atexit([] {
     std::error_code ignored;
-    std::filesystem::remove_all(isolation.registryDir, ignored);
-  }
+    std::filesystem::remove_all(g_registryDir, ignored);
+  });
 }
 #endif
 
@@ -67,11 +77,10 @@ void Release() {
 
 int main(int argc, char** argv) {
 #if !defined(_WIN32)
-  Isolate(g_isolation);
-  std::atexit(Release);
+  Isolate();
 #endif
   ::testing::InitGoogleTest(&argc, argv);
-  skytest::InstallLeakCheck();
+  ::testing::UnitTest::GetInstance()->listeners().Append(new LeakCheck);
   int result = RUN_ALL_TESTS();
   // A child must have run exactly its one case, and passed it; a filter that
   // matched nothing must not count as success.

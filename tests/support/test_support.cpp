@@ -7,6 +7,32 @@
 
 namespace skytest {
 
+namespace {
+DWORD WINAPI RunBody(LPVOID body) {
+  return (*static_cast<std::function<DWORD()>*>(body))();
+}
+}  // namespace
+
+Thread::Thread(std::function<DWORD()> body)
+    : body_(std::make_unique<std::function<DWORD()>>(std::move(body))),
+      handle_(CreateThread(nullptr, 0, RunBody, body_.get(), 0, &id_)) {
+  EXPECT_TRUE(handle_) << "CreateThread failed";
+}
+
+// The body must outlive the thread, so a thread that did not end is waited
+// for without limit (a hang then ends through the test's time-out).
+Thread::~Thread() {
+  if (handle_) WaitForSingleObject(handle_.Get(), INFINITE);
+}
+
+DWORD Thread::Join() {
+  DWORD code = kNotEnded;
+  if (handle_ && WaitForSingleObject(handle_.Get(), kGuardMs) == WAIT_OBJECT_0) {
+    GetExitCodeThread(handle_.Get(), &code);
+  }
+  return code;
+}
+
 DWORD ScaledGuardMs() {
   constexpr double kRealMs = 10000.0;
   double scale = platform::TimeScale();

@@ -5,6 +5,8 @@
 
 #include <gtest/gtest.h>
 
+#include <functional>
+#include <memory>
 #include <string>
 
 #include "platform/wide.h"
@@ -51,6 +53,58 @@ class Handle {
 
  private:
   HANDLE handle_ = nullptr;
+};
+
+// An unnamed event.
+inline Handle NewEvent(bool manualReset = true, bool signalled = false) {
+  return Handle(CreateEventW(nullptr, manualReset, signalled, nullptr));
+}
+
+// An OVERLAPPED record with its own manual-reset event, as the service uses.
+struct Overlapped {
+  OVERLAPPED record{};
+  Handle event = NewEvent(true, false);
+  Overlapped() { record.hEvent = event.Get(); }
+  Overlapped(const Overlapped&) = delete;
+  Overlapped& operator=(const Overlapped&) = delete;
+  OVERLAPPED* Get() { return &record; }
+  bool Signalled() const { return WaitForSingleObject(event.Get(), 0) == WAIT_OBJECT_0; }
+};
+
+// An open registry key, closed at the end of its scope.
+class RegKey {
+ public:
+  RegKey() = default;
+  RegKey(const RegKey&) = delete;
+  RegKey& operator=(const RegKey&) = delete;
+  ~RegKey() {
+    if (key_ != nullptr) RegCloseKey(key_);
+  }
+  HKEY* Out() { return &key_; }
+  HKEY Get() const { return key_; }
+
+ private:
+  HKEY key_ = nullptr;
+};
+
+// A thread that runs `body`; its handle is closed, after the thread ended,
+// when the object goes.
+class Thread {
+ public:
+  static constexpr DWORD kNotEnded = 0xFFFFFFF0;
+  explicit Thread(std::function<DWORD()> body);
+  Thread(const Thread&) = delete;
+  Thread& operator=(const Thread&) = delete;
+  ~Thread();
+  HANDLE Get() const { return handle_.Get(); }
+  DWORD Id() const { return id_; }
+  // Waits up to kGuardMs for the thread to end: its exit code, or kNotEnded.
+  DWORD Join();
+
+ private:
+  std::unique_ptr<std::function<DWORD()>> body_;
+  DWORD id_ = 0;
+  Handle handle_;
 };
 
 // True when the Windows build runs under Wine (never on the host build).
