@@ -3,6 +3,7 @@
 
 #include <errno.h>
 #include <linux/futex.h>
+#include <pthread.h>
 #include <signal.h>
 #include <sys/syscall.h>
 #include <time.h>
@@ -206,14 +207,15 @@ void Save(const void* address, std::size_t length) {
   Region& region = GetRegion();
   auto* base = reinterpret_cast<const std::uint8_t*>(&region);
   auto* at = static_cast<const std::uint8_t*>(address);
-  if (at < base || at + length > base + sizeof(Region)) Fatal("journal of memory outside the region");
+  if (at < base || at + length > base + sizeof(Region))
+    Fatal("journal of memory outside the region");
   Journal& journal = region.journal;
   if (journal.count == kJournalEntries || journal.bytes + length > kJournalBytes) {
     Fatal("the kernel journal is full");
   }
   std::memcpy(journal.data + journal.bytes, at, length);
-  journal.entries[journal.count] = JournalEntry{static_cast<std::uint32_t>(at - base),
-                                                static_cast<std::uint32_t>(length)};
+  journal.entries[journal.count] =
+      JournalEntry{static_cast<std::uint32_t>(at - base), static_cast<std::uint32_t>(length)};
   journal.bytes += static_cast<std::uint32_t>(length);
   // The entry counts only once its bytes are saved.
   __atomic_store_n(&journal.count, journal.count + 1, __ATOMIC_RELEASE);
@@ -301,8 +303,25 @@ bool SameProcess(const ProcessId& a, const ProcessId& b) {
   return a.pid == b.pid && a.startTime == b.startTime;
 }
 
+namespace {
+
+// The thread's id, asked of the system once: every kernel call names its
+// caller. A forked child's one thread has a new id, so it asks again.
+thread_local std::int32_t cachedThreadId = 0;
+
+void ForgetThreadIdInChild() {
+  cachedThreadId = 0;
+}
+
+}  // namespace
+
 std::int32_t ThreadId() {
-  return static_cast<std::int32_t>(gettid());
+  if (cachedThreadId == 0) {
+    static const int registered = pthread_atfork(nullptr, nullptr, ForgetThreadIdInChild);
+    (void)registered;
+    cachedThreadId = static_cast<std::int32_t>(gettid());
+  }
+  return cachedThreadId;
 }
 
 void ReapProcess(const ProcessId& process) {
