@@ -162,11 +162,16 @@ BYTE ReadButtonEvent(ChannelRecord* channel) {
 DWORD ReadDriveIdentity(ChannelRecord* channel, BYTE* buffer, DWORD length) {
   if (channel == nullptr) return 0;
   if (channel->kind == kChannelKindHid) {
+    // The serial string is asked for as HidD_GetSerialNumberString asks,
+    // but overlapped, so that a collection that never answers is given up
+    // at the device time-out or when the workers stop.
     const HANDLE device = CreateFileW(channel->devicePath, 0, FILE_SHARE_READ | FILE_SHARE_WRITE,
-                                      nullptr, OPEN_EXISTING, 0, nullptr);
+                                      nullptr, OPEN_EXISTING, FILE_FLAG_OVERLAPPED, nullptr);
     if (device == INVALID_HANDLE_VALUE) return 0;
     WCHAR serial[kSerialBufferBytes / sizeof(WCHAR) + 1] = {};
-    const BOOLEAN ok = HidD_GetSerialNumberString(device, serial, kSerialBufferBytes);
+    DWORD bytes = 0;
+    const bool ok = IoControlWait(device, IOCTL_HID_GET_SERIALNUMBER_STRING, nullptr, 0, serial,
+                                  kSerialBufferBytes, &bytes, monitorState.workerStopEvent);
     const DWORD error = GetLastError();
     CloseHandle(device);
     if (!ok) {

@@ -2,6 +2,8 @@
 // vanished device, and the identity query.
 #include "transport/button_events.h"
 
+#include <chrono>
+#include <future>
 #include <thread>
 
 #include "commands_fixture.h"
@@ -149,6 +151,18 @@ TEST_F(ButtonEventTest, HidIdentityIsTheSerialStringWhateverTheLength) {
   gauge->identityText[0] = WSTR('Z');
   EXPECT_EQ(ReadDriveIdentity(gauge, reinterpret_cast<BYTE*>(buffer), 256), 0u);
   EXPECT_EQ(gauge->identityText[0], WSTR('Z')) << "a failed read changes nothing";
+
+  // A collection that never answers is given up when the workers stop.
+  machine_.HangIo("gauge", sim::Endpoint::Hid, true);
+  SetEvent(monitorState.workerStopEvent);
+  auto hung = std::async(std::launch::async, [&] {
+    return ReadDriveIdentity(gauge, reinterpret_cast<BYTE*>(buffer), 256);
+  });
+  const bool ended = hung.wait_for(std::chrono::seconds(60)) == std::future_status::ready;
+  machine_.HangIo("gauge", sim::Endpoint::Hid, false);
+  ASSERT_TRUE(ended) << "a hung HID collection held the worker past its stop";
+  EXPECT_EQ(hung.get(), 0u);
+  EXPECT_EQ(gauge->identityText[0], WSTR('Z'));
 }
 
 }  // namespace

@@ -94,7 +94,7 @@ inline constexpr GUID kHidInterfaceClass = {
 // Internal controls by which the HID class library reaches a HID collection
 // opened with CreateFileW (as the real library does). METHOD_NEITHER and
 // METHOD_OUT_DIRECT codes of device type FILE_DEVICE_KEYBOARD.
-constexpr DWORD kHidIoctlGetSerialNumberString = 0x000B01C3;
+constexpr DWORD kHidIoctlGetSerialNumberString = 0x000B01C2;
 constexpr DWORD kHidIoctlGetInputReport = 0x000B01A2;
 
 }  // namespace emu

@@ -19,8 +19,9 @@ static_assert(FSCTL_UNLOCK_VOLUME ==
               CTL_CODE(FILE_DEVICE_FILE_SYSTEM, 7, METHOD_BUFFERED, FILE_ANY_ACCESS));
 static_assert(FSCTL_DISMOUNT_VOLUME ==
               CTL_CODE(FILE_DEVICE_FILE_SYSTEM, 8, METHOD_BUFFERED, FILE_ANY_ACCESS));
-static_assert(emu::kHidIoctlGetSerialNumberString ==
-              CTL_CODE(FILE_DEVICE_KEYBOARD, 112, METHOD_NEITHER, FILE_ANY_ACCESS));
+static_assert(emu::kHidIoctlGetSerialNumberString == IOCTL_HID_GET_SERIALNUMBER_STRING &&
+              emu::kHidIoctlGetSerialNumberString ==
+                  CTL_CODE(FILE_DEVICE_KEYBOARD, 112, METHOD_OUT_DIRECT, FILE_ANY_ACCESS));
 static_assert(emu::kHidIoctlGetInputReport == IOCTL_HID_GET_INPUT_REPORT &&
               emu::kHidIoctlGetInputReport ==
                   CTL_CODE(FILE_DEVICE_KEYBOARD, 104, METHOD_OUT_DIRECT, FILE_ANY_ACCESS));
