@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "control_protocol.h"
+#include "pipe/pipe_client.h"
 #include "verbs.h"
 
 namespace {
@@ -55,6 +56,29 @@ int Simple(const std::vector<std::string>& words) {
   std::string output;
   const int code = Request(words, &output);
   if (code == 0) std::fputs(output.c_str(), stdout);
+  return code;
+}
+
+// Forwards a device change to the service over its pipe (command 6), as the
+// user-interface application forwards the broadcasts it receives: a service
+// run in the foreground registers no device notifications and learns of
+// arrivals only so. Best effort: the machine has acted either way.
+void ForwardDeviceChange(DWORD eventType) {
+  constexpr DWORD kDeviceChangeMessage = 0x219;
+  HANDLE pipe = OpenCommandPipe(1000);
+  if (pipe == INVALID_HANDLE_VALUE) return;
+  auto message = std::make_unique<CommandMessage>();
+  InitCommand(message.get(), kCommandForwardMessage, kDeviceChangeMessage, eventType, 0);
+  auto reply = std::make_unique<CommandMessage>();
+  DWORD received = 0;
+  ExchangeCommand(pipe, message.get(), sizeof(CommandMessage), reply.get(), sizeof(CommandMessage),
+                  &received);
+  CloseHandle(pipe);
+}
+
+int Plugged(const std::vector<std::string>& words, DWORD eventType) {
+  const int code = Simple(words);
+  if (code == 0) ForwardDeviceChange(eventType);
   return code;
 }
 
@@ -137,7 +161,7 @@ int Add(const std::string& path) {
   std::ifstream file(path);
   std::stringstream text;
   if (!file || !(text << file.rdbuf())) return Fail("add: cannot read " + path);
-  return Simple({"add", text.str()});
+  return Plugged({"add", text.str()}, 0x8000);
 }
 
 bool IsHexStatus(const std::string& text) {
@@ -171,11 +195,11 @@ void AddSimVerbs(CLI::App& app, int* exitCode) {
   CLI::App* unplug =
       sim->add_subcommand("unplug", "Pull the drive's cable: pending I/O ends with error 1167");
   unplug->add_option("DRIVE", a->drive, driveHelp)->required();
-  unplug->callback([a, exitCode] { *exitCode = Simple({"unplug", a->drive}); });
+  unplug->callback([a, exitCode] { *exitCode = Plugged({"unplug", a->drive}, 0x8004); });
 
   CLI::App* plug = sim->add_subcommand("plug", "Plug the drive in (again)");
   plug->add_option("DRIVE", a->drive, driveHelp)->required();
-  plug->callback([a, exitCode] { *exitCode = Simple({"plug", a->drive}); });
+  plug->callback([a, exitCode] { *exitCode = Plugged({"plug", a->drive}, 0x8000); });
 
   CLI::App* add =
       sim->add_subcommand("add", "Plug in new drives described in the machine text format");
