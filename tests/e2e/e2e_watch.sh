@@ -8,7 +8,8 @@ CLIENT=$2
 WORK=$(mktemp -d)
 export SKYVANE_NAMESPACE="e2e-watch-$$"
 export SKYVANE_REGISTRY="$WORK/registry"
-export SKYVANE_TIME_SCALE=0.1
+# Ticks of 300 ms: watch (which looks every 100 ms) sees every publish.
+export SKYVANE_TIME_SCALE=0.3
 SOCKET="skyvane-e2e-watch-$$"
 SVC_PID=
 cleanup() {
@@ -25,15 +26,26 @@ fail() {
   for f in "$WORK"/*.txt; do [ -f "$f" ] && { echo "--- $f"; cat "$f"; }; done
   exit 1
 }
-# Polls the screen until it has a line matching the extended regex (60 s at
-# most; the monitor acts within a few scaled seconds).
-shows() {
+# Polls the screen until it has a line matching the extended regex: true
+# once it does, false after $3 tenths of a second (default 600).
+appears() {
   i=0
   until screen | grep -Eq -- "$1"; do
     i=$((i + 1))
-    [ $i -gt 600 ] && fail "the screen never showed /$1/ ($2)"
+    [ $i -gt "${2:-600}" ] && return 1
     sleep 0.1
   done
+}
+shows() { appears "$1" || fail "the screen never showed /$1/ ($2)"; }
+# Presses a button until the screen shows the pattern: a press that comes
+# while the service reopens the drive's channel (a rescan) is lost, as on
+# the device.
+press_until() {
+  for _ in 1 2 3 4 5; do
+    sim press "$1" "$2"
+    appears "$3" 150 && return 0
+  done
+  fail "pressing $2 on $1 never showed /$3/"
 }
 # The drive rows only (the part between "Drives" and "Channels").
 drive_rows() { screen | sed -n '/^Drives/,/^Channels/p'; }
@@ -67,16 +79,14 @@ sim fill E 80
 shows "^  [0-9]+ +E: .*\[###-\]  80%" "E: at 80 %"
 
 # Eject on the gauge drive: it goes; plugged in again, it comes back.
-sim press gauge eject
-shows "went away \(E:\)" "eject event"
+press_until gauge eject "went away \(E:\)"
 drive_rows | grep -q " E: " && fail "E: still listed after the eject"
 sim plug gauge
 shows "^  [0-9]+ +E: " "E: back after plug"
 
 # Another program holds the volume: the removal fails, the status word says so.
 sim hold E
-sim press gauge eject
-shows "status word 60[0-9]: removal of drive [0-9]+ failed" "failed removal"
+press_until gauge eject "status word 60[0-9]: removal of drive [0-9]+ failed"
 drive_rows | grep -q " E: " || fail "E: gone although the removal failed"
 sim release E
 
