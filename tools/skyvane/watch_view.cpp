@@ -132,9 +132,10 @@ void WatchView::Update(const StateBlock& block, const std::string& clock) {
       if (after->letters != before.letters) {
         Note(clock, before.name + ": letters " + before.letters + " -> " + after->letters);
       }
-      if (after->gaugePercent != before.gaugePercent) {
-        Note(clock, Format("%s: gauge %u%% -> %u%%", before.name.c_str(),
-                           static_cast<unsigned>(before.gaugePercent),
+      // A record rebuilt by an enumeration has no gauge value yet (0) until
+      // the next refresh: only values computed are worth a line.
+      if (after->gaugePercent != before.gaugePercent && after->gaugePercent != 0) {
+        Note(clock, Format("%s: gauge %u%%", before.name.c_str(),
                            static_cast<unsigned>(after->gaugePercent)));
       }
       if (after->statusCode != before.statusCode) {
