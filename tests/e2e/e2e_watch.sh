@@ -14,10 +14,12 @@ SOCKET="skyvane-e2e-watch-$$"
 SVC_PID=
 cleanup() {
   tmux -L "$SOCKET" kill-server 2>/dev/null
+  rm -f "${TMUX_TMPDIR:-/tmp}/tmux-$(id -u)/$SOCKET"
   [ -n "$SVC_PID" ] && kill -9 "$SVC_PID" 2>/dev/null
   rm -rf "$WORK"
 }
 trap cleanup EXIT
+trap "exit 1" INT TERM HUP PIPE
 screen() { tmux -L "$SOCKET" capture-pane -p -t watch; }
 fail() {
   echo "FAIL: $*"
