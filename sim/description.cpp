@@ -316,8 +316,12 @@ end
 
 }  // namespace
 
-std::unique_ptr<Machine> LoadMachine(std::string_view text, std::string* error) {
-  auto machine = std::make_unique<Machine>();
+namespace {
+
+// Reads a description into `machine`; with `drives` set instead, only drive
+// blocks are allowed and they are collected there, the machine untouched.
+bool ReadDescription(std::string_view text, Machine* machine, std::vector<DriveSpec>* drives,
+                     std::string* error) {
   std::istringstream in{std::string(text)};
   std::string line;
   int number = 0;
@@ -326,7 +330,7 @@ std::unique_ptr<Machine> LoadMachine(std::string_view text, std::string* error) 
   std::vector<VolumeSpec> looseVolumes;
   auto fail = [&](const std::string& why) {
     if (error != nullptr) *error = "line " + std::to_string(number) + ": " + why;
-    return nullptr;
+    return false;
   };
   while (std::getline(in, line)) {
     ++number;
@@ -339,6 +343,11 @@ std::unique_ptr<Machine> LoadMachine(std::string_view text, std::string* error) 
     if (inBlock) {
       if (key == "end") {
         inBlock = false;
+        if (drives != nullptr) {
+          if (block.spec.bus == Bus::Other) return fail("a drive of the maker is on usb or 1394");
+          drives->push_back(block.spec);
+          continue;
+        }
         if (block.foreign) {
           if (block.spec.diskInstanceId.empty() || block.spec.diskPath.empty()) {
             return fail("a disk needs disk-instance-id and disk-path");
@@ -354,6 +363,7 @@ std::unique_ptr<Machine> LoadMachine(std::string_view text, std::string* error) 
       if (!ParseDriveKey(key, value, &block)) return fail("cannot use \"" + trimmed + "\"");
       continue;
     }
+    if (drives != nullptr && key != "drive") return fail("only drive blocks can be added");
     if (key == "os") {
       std::istringstream v(value);
       std::string version;
@@ -395,6 +405,18 @@ std::unique_ptr<Machine> LoadMachine(std::string_view text, std::string* error) 
     }
   }
   if (inBlock) return fail("missing \"end\"");
+  return true;
+}
+
+}  // namespace
+
+bool ReadDriveBlocks(std::string_view text, std::vector<DriveSpec>* drives, std::string* error) {
+  return ReadDescription(text, nullptr, drives, error);
+}
+
+std::unique_ptr<Machine> LoadMachine(std::string_view text, std::string* error) {
+  auto machine = std::make_unique<Machine>();
+  if (!ReadDescription(text, machine.get(), nullptr, error)) return nullptr;
   return machine;
 }
 

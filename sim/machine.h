@@ -221,6 +221,8 @@ class Machine : public emu::DeviceModel {
   void SetCancelDelay(const std::string& drive, Endpoint endpoint, DWORD delayMs);
   void FinishHeldCancels();
   void ClearFaults();
+  // Turns off the open, I/O, hang and cancel-delay faults of one drive.
+  void ClearFaults(const std::string& drive);
 
   // ---- Observation ----
   // Requests pending now on the drive's endpoint.
@@ -235,6 +237,35 @@ class Machine : public emu::DeviceModel {
   void ClearCommands();
   // Readable transcript of every command, one line each.
   std::string Transcript() const;
+
+  // ---- Inventory (what a person controlling the machine sees) ----
+  struct VolumeSummary {
+    char letter = 0;
+    std::uint64_t sizeBytes = 0;
+    std::uint64_t freeBytes = 0;
+    bool heldOpen = false;
+    bool present = false;
+  };
+  struct DriveSummary {
+    std::string name;
+    int index = 0;  // in the order the drives were added
+    Bus bus = Bus::Usb;
+    ChannelKind channel = ChannelKind::Hid;
+    bool attached = false;   // its disk is present
+    bool connected = false;  // on the bus at all (an eject may leave its HID function)
+    std::uint8_t status[4] = {};
+    std::uint8_t sleepState = 0;
+    std::vector<VolumeSummary> volumes;
+  };
+  std::vector<DriveSummary> Drives() const;
+  // The volume with that letter (present or on a detached drive); false
+  // when the machine has none.
+  bool FindVolume(char letter, VolumeSummary* volume) const;
+  // Adds the drives of a description text (drive blocks only, README.md)
+  // detached and then plugs each in, as a person connects a new drive.
+  // Nothing is added when the text is not valid or names a drive the machine
+  // already has; *error says why.
+  bool PlugDrives(std::string_view text, std::vector<std::string>* names, std::string* error);
 
   // ---- emu::DeviceModel ----
   bool ListInterfaces(const GUID& interfaceClass, std::vector<emu::InterfaceEntry>* out,

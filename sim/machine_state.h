@@ -214,6 +214,10 @@ std::string UnitId(const DriveSpec& spec, int index);
 // The 64-bit identity the button filter driver reports.
 std::uint64_t Identity(const DriveSpec& spec, int index);
 
+// The drive blocks of a description text (description.cpp); false with
+// *error when the text is not valid or has anything but drive blocks.
+bool ReadDriveBlocks(std::string_view text, std::vector<DriveSpec>* drives, std::string* error);
+
 // SCSI answers of a drive (scsi.cpp). `dataIn` receives the data the command
 // returns; the result is the SCSI status (0 good, 2 check condition).
 std::uint8_t ExecuteScsi(DriveState* drive, const DriveSpec& spec, bool enclosureDevice,

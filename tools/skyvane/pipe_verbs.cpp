@@ -5,8 +5,6 @@
 //   send LENGTH COMMAND [ARG1 [ARG2 [ARG3]]] [--bytes N]
 // Each prints the result and detail of the reply in words and exits 0 only
 // when the service did what was asked.
-#include "pipe_verbs.h"
-
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -18,6 +16,7 @@
 #include "pipe/pipe_client.h"
 #include "platform/wide.h"
 #include "platform/win32.h"
+#include "verbs.h"
 
 namespace {
 
@@ -103,16 +102,6 @@ bool ParseDword(const char* text, DWORD* value) {
   if (!ParseNumber(text, &wide)) return false;
   *value = static_cast<DWORD>(wide);
   return true;
-}
-
-int Usage() {
-  std::fprintf(stderr,
-               "usage: skyvane pause | resume | set-status VALUE\n"
-               "       skyvane reg get ROOT\\PATH NAME\n"
-               "       skyvane reg set ROOT\\PATH NAME TYPE DATA  (TYPE sz, expand_sz, dword, "
-               "qword, binary)\n"
-               "       skyvane send LENGTH COMMAND [ARG1 [ARG2 [ARG3]]] [--bytes N]\n");
-  return 2;
 }
 
 // A command without data; `success` is the result that means it was done.
@@ -226,17 +215,22 @@ void PrintData(DWORD type, const BYTE* data, DWORD length) {
   }
 }
 
-int RegistryVerb(int argc, char** argv) {
-  if (argc < 5) return Usage();
-  const std::string action = argv[2];
+struct RegistryArgs {
+  std::string key;
+  std::string name;
+  std::string type;
+  std::string data;
+};
+
+int RegistryVerb(const std::string& action, const RegistryArgs& args) {
   HKEY root = nullptr;
   WideString path;
-  if (!SplitKey(argv[3], &root, &path)) return 2;
-  const WideString name = Utf8ToWide(argv[4]);
+  if (!SplitKey(args.key.c_str(), &root, &path)) return 2;
+  const WideString name = Utf8ToWide(args.name);
   auto message = std::make_unique<CommandMessage>();
   InitCommand(message.get(), kCommandRegistry);
 
-  if (action == "get" && argc == 5) {
+  if (action == "get") {
     // The data area takes all the room the message has left.
     if (!LayOutRegistryRequest(message.get(), RootKeyValue(root), path.c_str(), name.c_str(),
                                kRegistryQuery, REG_NONE, nullptr, 0)) {
@@ -246,11 +240,11 @@ int RegistryVerb(int argc, char** argv) {
     const std::size_t used =
         static_cast<std::size_t>(message->registry.nameOffset + message->registry.dataOffset);
     message->registry.dataLength = static_cast<DWORD>(sizeof(message->registryText) - used);
-  } else if (action == "set" && argc == 7) {
+  } else {
     DWORD type = 0;
     std::vector<BYTE> data;
-    if (!EncodeData(argv[5], argv[6], &type, &data)) {
-      std::fprintf(stderr, "cannot read %s as %s data\n", argv[6], argv[5]);
+    if (!EncodeData(args.type.c_str(), args.data.c_str(), &type, &data)) {
+      std::fprintf(stderr, "cannot read %s as %s data\n", args.data.c_str(), args.type.c_str());
       return 2;
     }
     if (!LayOutRegistryRequest(message.get(), RootKeyValue(root), path.c_str(), name.c_str(),
@@ -258,8 +252,6 @@ int RegistryVerb(int argc, char** argv) {
       std::fprintf(stderr, "key path, name and data do not fit in one request\n");
       return 2;
     }
-  } else {
-    return Usage();
   }
 
   Reply reply;
@@ -287,33 +279,27 @@ int RegistryVerb(int argc, char** argv) {
 // Raw request for tests: a message declaring LENGTH (any 64-bit value), of
 // which --bytes N are sent (default: LENGTH, at most twice the largest
 // message). Prints the reply's length, result and detail.
-int SendVerb(int argc, char** argv) {
-  if (argc < 4) return Usage();
+struct SendArgs {
+  std::vector<std::string> words;  // LENGTH COMMAND [ARG1 [ARG2 [ARG3]]]
+  std::string bytes;
+};
+
+int SendVerb(const SendArgs& args) {
   std::uint64_t declared = 0;
   DWORD command = 0;
-  DWORD args[3] = {};
+  DWORD values[3] = {};
   std::uint64_t sent = 0;
-  bool sentGiven = false;
-  int position = 0;
-  for (int i = 2; i < argc; ++i) {
-    if (std::strcmp(argv[i], "--bytes") == 0 && i + 1 < argc) {
-      if (!ParseNumber(argv[++i], &sent)) return Usage();
-      sentGiven = true;
-      continue;
-    }
-    bool ok = false;
-    if (position == 0) {
-      ok = ParseNumber(argv[i], &declared);
-    } else if (position == 1) {
-      ok = ParseDword(argv[i], &command);
-    } else if (position <= 4) {
-      ok = ParseDword(argv[i], &args[position - 2]);
-    }
-    if (!ok) return Usage();
-    ++position;
+  bool ok = args.words.size() >= 2 && ParseNumber(args.words[0].c_str(), &declared) &&
+            ParseDword(args.words[1].c_str(), &command);
+  for (std::size_t i = 2; ok && i < args.words.size(); ++i) {
+    ok = ParseDword(args.words[i].c_str(), &values[i - 2]);
   }
-  if (position < 2) return Usage();
-  if (!sentGiven) sent = declared;
+  if (ok && !args.bytes.empty()) ok = ParseNumber(args.bytes.c_str(), &sent);
+  if (!ok) {
+    std::fprintf(stderr, "send: LENGTH, COMMAND, the arguments and --bytes are numbers\n");
+    return 2;
+  }
+  if (args.bytes.empty()) sent = declared;
   if (sent > 2 * kCommandMaxLength) {
     std::fprintf(stderr, "at most %lu bytes can be sent\n",
                  static_cast<unsigned long>(2 * kCommandMaxLength));
@@ -321,7 +307,7 @@ int SendVerb(int argc, char** argv) {
   }
   std::vector<BYTE> request(2 * kCommandMaxLength, 0);
   auto message = std::make_unique<CommandMessage>();
-  InitCommand(message.get(), command, args[0], args[1], args[2]);
+  InitCommand(message.get(), command, values[0], values[1], values[2]);
   message->length = declared;
   std::memcpy(request.data(), message.get(), sizeof(CommandMessage));
   Reply reply;
@@ -337,18 +323,45 @@ int SendVerb(int argc, char** argv) {
 
 }  // namespace
 
-int RunPipeVerb(int argc, char** argv) {
-  if (argc < 2) return Usage();
-  const std::string verb = argv[1];
-  if (verb == "pause" && argc == 2) return SimpleCommand(kCommandPause, 0, 0);
-  if (verb == "resume" && argc == 2) return SimpleCommand(kCommandResume, 0, 0);
-  if (verb == "set-status" && argc == 3) {
-    DWORD value = 0;
-    if (!ParseDword(argv[2], &value)) return Usage();
-    return SimpleCommand(kCommandSetStatus, value, 1);
-  }
-  if (verb == "reg") return RegistryVerb(argc, argv);
-  if (verb == "send") return SendVerb(argc, argv);
-  std::fprintf(stderr, "unknown verb: %s\n", verb.c_str());
-  return Usage();
+void AddPipeVerbs(CLI::App& app, int* exitCode) {
+  app.add_subcommand("pause", "Pause the service's polling")->callback([exitCode] {
+    *exitCode = SimpleCommand(kCommandPause, 0, 0);
+  });
+  app.add_subcommand("resume", "Resume the service's polling")->callback([exitCode] {
+    *exitCode = SimpleCommand(kCommandResume, 0, 0);
+  });
+  auto value = std::make_shared<std::string>();
+  CLI::App* setStatus = app.add_subcommand("set-status", "Set the block's status word");
+  setStatus->add_option("VALUE", *value, "The new status word")->required();
+  setStatus->callback([value, exitCode] {
+    DWORD number = 0;
+    if (!ParseDword(value->c_str(), &number)) {
+      std::fprintf(stderr, "set-status: %s is not a number\n", value->c_str());
+      *exitCode = 2;
+      return;
+    }
+    *exitCode = SimpleCommand(kCommandSetStatus, number, 1);
+  });
+
+  auto reg = std::make_shared<RegistryArgs>();
+  CLI::App* regVerb = app.add_subcommand("reg", "Registry access through the service");
+  regVerb->require_subcommand(1);
+  CLI::App* get = regVerb->add_subcommand("get", "Read a value");
+  get->add_option("KEY", reg->key, "ROOT\\PATH (HKCR, HKCU, HKLM, HKU or HKCC)")->required();
+  get->add_option("NAME", reg->name, "Value name")->required();
+  get->callback([reg, exitCode] { *exitCode = RegistryVerb("get", *reg); });
+  CLI::App* set = regVerb->add_subcommand("set", "Write a value");
+  set->add_option("KEY", reg->key, "ROOT\\PATH (HKCR, HKCU, HKLM, HKU or HKCC)")->required();
+  set->add_option("NAME", reg->name, "Value name")->required();
+  set->add_option("TYPE", reg->type, "sz, expand_sz, dword, qword or binary (hex)")->required();
+  set->add_option("DATA", reg->data, "The value's data")->required();
+  set->callback([reg, exitCode] { *exitCode = RegistryVerb("set", *reg); });
+
+  auto send = std::make_shared<SendArgs>();
+  CLI::App* sendVerb = app.add_subcommand("send", "Send a raw request (for tests)");
+  sendVerb->add_option("LENGTH COMMAND ARGS", send->words, "LENGTH COMMAND [ARG1 [ARG2 [ARG3]]]")
+      ->required()
+      ->expected(2, 5);
+  sendVerb->add_option("--bytes", send->bytes, "Bytes to send (default LENGTH)")->type_name("N");
+  sendVerb->callback([send, exitCode] { *exitCode = SendVerb(*send); });
 }

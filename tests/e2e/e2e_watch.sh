@@ -1,0 +1,161 @@
+#!/bin/sh
+# The host service with `skyvane watch` in a terminal (tmux, own socket) and
+# the `sim` verbs acting on the service's simulated machine from another
+# process: after each step the screen must show the result.
+set -u
+SVC=$1
+CLIENT=$2
+WORK=$(mktemp -d)
+export SKYVANE_NAMESPACE="e2e-watch-$$"
+export SKYVANE_REGISTRY="$WORK/registry"
+# Ticks of 300 ms: watch (which looks every 100 ms) sees every publish.
+export SKYVANE_TIME_SCALE=0.3
+SOCKET="skyvane-e2e-watch-$$"
+SVC_PID=
+cleanup() {
+  tmux -L "$SOCKET" kill-server 2>/dev/null
+  rm -f "${TMUX_TMPDIR:-/tmp}/tmux-$(id -u)/$SOCKET"
+  [ -n "$SVC_PID" ] && kill -9 "$SVC_PID" 2>/dev/null
+  rm -rf "$WORK"
+}
+trap cleanup EXIT
+trap "exit 1" INT TERM HUP PIPE
+screen() { tmux -L "$SOCKET" capture-pane -p -t watch; }
+fail() {
+  echo "FAIL: $*"
+  echo "--- screen"
+  screen
+  for f in "$WORK"/*.txt; do [ -f "$f" ] && { echo "--- $f"; cat "$f"; }; done
+  exit 1
+}
+# Polls the screen until it has a line matching the extended regex: true
+# once it does, false after $3 tenths of a second (default 600).
+appears() {
+  i=0
+  until screen | grep -Eq -- "$1"; do
+    i=$((i + 1))
+    [ $i -gt "${2:-600}" ] && return 1
+    sleep 0.1
+  done
+}
+shows() { appears "$1" || fail "the screen never showed /$1/ ($2)"; }
+# Presses a button until the screen shows the pattern: a press that comes
+# while the service reopens the drive's channel (a rescan) is lost, as on
+# the device.
+press_until() {
+  for _ in 1 2 3 4 5; do
+    sim press "$1" "$2"
+    appears "$3" 150 && return 0
+  done
+  fail "pressing $2 on $1 never showed /$3/"
+}
+# The drive rows only (the part between "Drives" and "Channels").
+drive_rows() { screen | sed -n '/^Drives/,/^Channels/p'; }
+sim() { "$CLIENT" sim "$@" >"$WORK/sim.txt" 2>&1 || fail "sim $* exited $?"; }
+# A refused request: exit 2, one line on stderr, nothing on stdout.
+refused() {
+  "$CLIENT" sim "$@" >"$WORK/out.txt" 2>"$WORK/err.txt"
+  rc=$?
+  [ $rc = 2 ] || fail "sim $*: exit $rc, wanted 2"
+  [ "$(wc -l <"$WORK/err.txt")" = 1 ] || fail "sim $*: not one line on stderr"
+  [ -s "$WORK/out.txt" ] && fail "sim $*: wrote to stdout"
+  return 0
+}
+
+refused list # no service running yet
+grep -q "no simulated machine answers" "$WORK/err.txt" || fail "no-service message"
+
+"$SVC" -debug >"$WORK/service.txt" 2>&1 &
+SVC_PID=$!
+"$CLIENT" status --wait-open --wait-status 102 --timeout-ms 60000 >/dev/null 2>&1 || fail "service never ready"
+
+tmux -L "$SOCKET" new-session -d -s watch -x 132 -y 60 \
+  -e SKYVANE_NAMESPACE="$SKYVANE_NAMESPACE" -e SKYVANE_TIME_SCALE="$SKYVANE_TIME_SCALE" \
+  "$CLIENT watch --wait-open" || fail "tmux did not start"
+tmux -L "$SOCKET" set-option -t watch remain-on-exit on >/dev/null
+shows "status word 102: ready" "first view"
+shows "^  [0-9]+ +E: .*\[[#-]{4}\]" "gauge drive with its 4-segment bar"
+
+# The gauge follows the volume's used space.
+sim fill E 80
+shows "^  [0-9]+ +E: .*\[###-\]  80%" "E: at 80 %"
+
+# Eject on the gauge drive: it goes; plugged in again, it comes back.
+press_until gauge eject "went away \(E:\)"
+drive_rows | grep -q " E: " && fail "E: still listed after the eject"
+sim plug gauge
+shows "^  [0-9]+ +E: " "E: back after plug"
+
+# Another program holds the volume: the removal fails, the status word says so.
+sim hold E
+press_until gauge eject "status word 60[0-9]: removal of drive [0-9]+ failed"
+drive_rows | grep -q " E: " || fail "E: gone although the removal failed"
+sim release E
+
+# A surprise removal, and the sleep state of another drive.
+sim unplug firewire
+i=0
+while drive_rows | grep -q " H: "; do
+  i=$((i + 1))
+  [ $i -gt 600 ] && fail "H: still listed after the unplug"
+  sleep 0.1
+done
+sim sleep enclosure 2
+shows "^  [0-9]+ +I: .* 2 *$" "sleep state 2 on I:"
+
+# A new drive from a description file arrives with its volume.
+printf 'drive spare\n  bus usb\n  channel hid\n  serial QX-5P4R3S21\n  volume J fixed 250G 200G\nend\n' >"$WORK/spare.txt"
+sim add "$WORK/spare.txt"
+shows "arrived \(J:\)" "added drive"
+
+# Bad input changes nothing and says why in one line.
+"$CLIENT" sim list --json >"$WORK/before.txt" 2>&1 || fail "sim list --json"
+grep -q '"name": "gauge"' "$WORK/before.txt" || fail "list --json has no gauge drive"
+while read -r args; do
+  # shellcheck disable=SC2086 # the row is the argument list
+  refused $args
+done <<ROWS
+press nosuch eject
+press 99 eject
+press gauge nosuch
+press enclosure panel1
+fill E 101
+fill E -1
+fill Q 50
+status gauge 12zz5678
+status gauge 1234
+sleep gauge 4
+fault gauge melt
+fault gauge slow-cancel x
+plug gauge
+unplug firewire
+hold 1
+add $WORK/absent.txt
+add $WORK/spare.txt
+ROWS
+printf 'drive x\n  bus usb\n  nonsense key\nend\n' >"$WORK/bad.txt"
+refused add "$WORK/bad.txt"
+"$CLIENT" sim list --json >"$WORK/after.txt" 2>&1 || fail "sim list --json after"
+cmp -s "$WORK/before.txt" "$WORK/after.txt" || fail "bad input changed the machine"
+
+# Without a terminal: plain text, no escape codes.
+"$CLIENT" watch --once >"$WORK/plain.txt" 2>&1 || fail "watch --once"
+grep -q "status word" "$WORK/plain.txt" || fail "watch --once printed no view"
+grep -q "$(printf '\033')" "$WORK/plain.txt" && fail "escape codes in plain output"
+
+# A hung device does not keep the service from stopping: the enclosure
+# drive's disk and enclosure device stop answering (pass-through requests
+# and event polls pend until cancelled).
+sim fault enclosure hang
+sim press enclosure eject
+kill -INT $SVC_PID
+i=0
+while kill -0 $SVC_PID 2>/dev/null; do
+  i=$((i + 1))
+  [ $i -gt 300 ] && fail "the service did not stop with a hung device"
+  sleep 0.1
+done
+wait $SVC_PID || fail "service exit code $?"
+SVC_PID=
+shows "status word 500: stopped" "stopped"
+echo "e2e watch: ok"
