@@ -3,16 +3,18 @@
 #include "monitor/monitor_state.h"
 #include "platform/wide.h"
 #include "service/service_host.h"
+#include "transport/pass_through.h"
 
 namespace {
 
 constexpr DWORD kErrorNoMediaInDrive = 1112;  // ERROR_NO_MEDIA_IN_DRIVE
 
+// A control without buffers on the overlapped volume handle, given up when
+// the volume does not answer within the device time-out or the service stops:
+// the callers hold the state mutex.
 bool PlainControl(HANDLE volume, DWORD code) {
   DWORD bytes = 0;
-  const BOOL ok = DeviceIoControl(volume, code, nullptr, 0, nullptr, 0, &bytes, nullptr);
-  static_cast<void>(GetLastError());
-  return ok != FALSE;
+  return IoControlWait(volume, code, nullptr, 0, nullptr, 0, &bytes, monitorState.stopEvent);
 }
 
 }  // namespace
@@ -36,7 +38,7 @@ int DismountVolume(WCHAR letter) {
   const WCHAR device[] = {WSTR('\\'), WSTR('\\'), WSTR('.'), WSTR('\\'), letter, WSTR(':'), 0};
   const HANDLE volume =
       CreateFileW(device, GENERIC_READ | GENERIC_WRITE, FILE_SHARE_READ | FILE_SHARE_WRITE, nullptr,
-                  OPEN_EXISTING, 0, nullptr);
+                  OPEN_EXISTING, FILE_FLAG_OVERLAPPED, nullptr);
   if (volume == INVALID_HANDLE_VALUE) return 0;
   const int dismounted = LockAndDismount(volume);
   if (!CloseHandle(volume)) return 0;
@@ -44,9 +46,7 @@ int DismountVolume(WCHAR letter) {
 }
 
 int LockAndDismount(HANDLE volume) {
-  DWORD bytes = 0;
-  if (!DeviceIoControl(volume, IOCTL_STORAGE_CHECK_VERIFY, nullptr, 0, nullptr, 0, &bytes,
-                       nullptr)) {
+  if (!PlainControl(volume, IOCTL_STORAGE_CHECK_VERIFY)) {
     const DWORD error = GetLastError();
     if (error != ERROR_NOT_READY && error != kErrorNoMediaInDrive) {
       // Anything but a missing medium may leave the volume mounted.

@@ -13,7 +13,8 @@ int DismountDriveVolumes(const DriveRecord* drive);
 // 1 when the volume of the letter was taken offline or holds no medium (the
 // drive list is then marked stale), else 0.
 int DismountVolume(WCHAR letter);
-// Medium check, lock, dismount, unlock on an open volume; nonzero on
+// Medium check, lock, dismount, unlock on a volume opened for overlapped
+// I/O (each control is given up at the device time-out or a stop); nonzero on
 // success or when the medium check finds no medium (not ready, no media);
 // any other failure of the check fails. A failed lock or dismount costs a
 // pause of 1000 ms.

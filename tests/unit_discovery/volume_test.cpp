@@ -2,10 +2,12 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
+#include <future>
 
 #include "discovery/drive_enumeration.h"
 #include "discovery_fixture.h"
 #include "platform/diagnostics.h"
+#include "support/test_support.h"
 #include "volume/dismount.h"
 #include "volume/volume_letters.h"
 
@@ -107,6 +109,19 @@ TEST_F(VolumeTest, FailedMediumCheckCountsAsDoneAndMarksTheListStale) {
   EXPECT_EQ(DismountVolume(WSTR('F')), 1);
   EXPECT_EQ(machine_.DismountCount('F'), 0);
   EXPECT_EQ(monitorState.driveListStale, 1u);
+}
+
+TEST_F(VolumeTest, AVolumeThatNeverAnswersIsGivenUpAtTheStop) {
+  Build({Volume('F', DRIVE_FIXED)});
+  machine_.HangIo("drive", sim::Endpoint::Volume, true);
+  const skytest::Handle stop = skytest::NewEvent(true, true);
+  monitorState.stopEvent = stop.Get();
+  auto dismount = std::async(std::launch::async, [] { return DismountVolume(WSTR('F')); });
+  const bool ended = dismount.wait_for(std::chrono::seconds(60)) == std::future_status::ready;
+  machine_.HangIo("drive", sim::Endpoint::Volume, false);
+  ASSERT_TRUE(ended) << "a hung volume held the caller (and the mutex it holds) past the stop";
+  EXPECT_EQ(dismount.get(), 0);
+  monitorState.stopEvent = nullptr;
 }
 
 TEST_F(VolumeTest, WrongDriveTypeIsReportedAndFails) {
