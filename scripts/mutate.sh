@@ -67,7 +67,7 @@ if [[ ! -f $build/CMakeCache.txt ]]; then
 fi
 # Every target but the benchmark, which the run leaves out.
 mapfile -t targets < <(ninja -C "$build" -t targets all 2>/dev/null |
-  sed -n 's/^\([A-Za-z0-9_]*\): phony$/\1/p' | grep -vE '^(all|clean|help|install.*|edit_cache|rebuild_cache|list_install_components|test|skyvane_bench)$')
+  sed -n 's/^\([A-Za-z0-9_]*\): phony$/\1/p' | grep -vE '^(cmake_.*|all|clean|help|install.*|edit_cache|rebuild_cache|list_install_components|test|skyvane_bench)$')
 
 build_tree() { nice_run cmake --build "$build" -j2 --target "${targets[@]}" >"$work/build.log" 2>&1; }
 
