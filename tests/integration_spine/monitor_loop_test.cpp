@@ -494,6 +494,8 @@ TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
     LONG publishedCount = 0;
     std::vector<DWORD> copyCode;
     std::vector<DWORD> ownCode;
+    std::vector<LONG> copyLevel;
+    std::vector<LONG> ownLevel;
   };
   std::vector<Seen> seen;
   Run([&seen](const std::vector<Pass>& passes) {
@@ -505,6 +507,8 @@ TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
       for (LONG p = 0; p < block->publishedCount; ++p) {
         now.copyCode.push_back(block->published[p].statusCode);
         now.ownCode.push_back(block->drives[block->published[p].recordIndex].statusCode);
+        now.copyLevel.push_back(block->published[p].statusLevel);
+        now.ownLevel.push_back(block->drives[block->published[p].recordIndex].statusLevel);
       }
     }
     seen.push_back(now);
@@ -514,8 +518,11 @@ TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
   ASSERT_GE(seen.back().publishedCount, 1);
   for (std::size_t i = 0; i < seen.size(); ++i) {
     EXPECT_EQ(seen[i].copyCode, seen[i].ownCode) << "pass " << i;
+    EXPECT_EQ(seen[i].copyLevel, seen[i].ownLevel) << "pass " << i;
     for (DWORD code : seen[i].copyCode) EXPECT_NE(code, 4u) << "pass " << i;
   }
+  // Every published drive answered its status page: a level of 0 to 3.
+  for (LONG level : seen.back().copyLevel) EXPECT_TRUE(level >= 0 && level <= 3) << level;
 }
 
 }  // namespace
