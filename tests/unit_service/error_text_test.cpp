@@ -70,9 +70,18 @@ TEST(ServiceControlHandler, EventsAndReportsWaitForTheirLocks) {
   EXPECT_TRUE(lockprobe::WaitsForTheSection(&deviceEventLock, [] {
     ServiceControlHandler(SERVICE_CONTROL_DEVICEEVENT, DBT_DEVICEARRIVAL, nullptr, nullptr);
   }));
-  EXPECT_TRUE(lockprobe::WaitsForTheSection(&serviceStatusLock, [] {
-    ServiceControlHandler(SERVICE_CONTROL_INTERROGATE, 0, nullptr, nullptr);
-  }));
+  // The state reported is read under the status lock: a change its holder
+  // makes meanwhile is the one reported.
+  debugMode = false;
+  serviceStatus.dwCurrentState = SERVICE_RUNNING;
+  EnterCriticalSection(&serviceStatusLock);
+  EXPECT_TRUE(lockprobe::WaitsForTheHeldLock(
+      [] { ServiceControlHandler(SERVICE_CONTROL_INTERROGATE, 0, nullptr, nullptr); },
+      [] {
+        serviceStatus.dwCurrentState = SERVICE_STOP_PENDING;
+        LeaveCriticalSection(&serviceStatusLock);
+      }));
+  EXPECT_EQ(serviceStatus.dwCurrentState, static_cast<DWORD>(SERVICE_STOP_PENDING));
   debugMode = saved;
 }
 
