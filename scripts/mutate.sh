@@ -4,12 +4,14 @@
 # wait codes, locks dropped or moved), each applied in turn, built in its own
 # tree and put to the host test suite. A tool to run by hand, not part of CI.
 #
-#   scripts/mutate.sh [--seed N] [--count N] [--list] [--timeout S] [--build DIR]
+#   scripts/mutate.sh [--seed N] [--count N] [--list] [--only I,J,...] [--timeout S] [--build DIR]
 #
 # Prints "killed|survived file:line kind: original -> mutated" per mutant
 # (killed ones name the first failing test), then the score. A mutant that
 # does not compile is stillborn: not counted, the next one in the list is
-# taken instead. The source is restored after each mutant and on any exit.
+# taken instead. --only runs just the mutants of those numbers of --list (to
+# check survivors again). The source is restored after each mutant and on any
+# exit. The benchmark's short mode is no test here and is left out.
 set -uo pipefail
 
 root=$(cd "$(dirname "$0")/.." && pwd)
@@ -18,6 +20,7 @@ count=60
 timeout=20
 build="$root/build/mutate"
 list=0
+only=""
 while [[ $# -gt 0 ]]; do
   case "$1" in
     --seed) seed=$2; shift 2 ;;
@@ -25,7 +28,8 @@ while [[ $# -gt 0 ]]; do
     --timeout) timeout=$2; shift 2 ;;
     --build) build=$2; shift 2 ;;
     --list) list=1; shift ;;
-    -h|--help) sed -n '2,12p' "$0" | sed 's/^# \{0,1\}//'; exit 0 ;;
+    --only) only=",$2,"; shift 2 ;;
+    -h|--help) sed -n '2,15p' "$0" | sed 's/^# \{0,1\}//'; exit 0 ;;
     *) echo "mutate.sh: unknown option $1" >&2; exit 2 ;;
   esac
 done
@@ -85,7 +89,7 @@ import json, re, sys
 programs = sys.argv[1:]
 skipped = [t["name"] for t in json.load(sys.stdin)["tests"]
            if not any(a.endswith("/" + p) or a == p for a in t.get("command", []) for p in programs)]
-print("|".join("^" + re.escape(n) + "$" for n in skipped) or "^$")' "${programs[@]}"
+print("|".join(["^bench"] + ["^" + re.escape(n) + "$" for n in skipped]))' "${programs[@]}"
 }
 
 # Runs the suite; prints the first failing test, or nothing if all passed.
@@ -121,6 +125,11 @@ stillborn=0
 index=0
 start=$(date +%s)
 while [[ $((killed + survived)) -lt $count && $index -lt $total ]]; do
+  if [[ -n $only && $only != *",$index,"* ]]; then
+    index=$((index + 1))
+    [[ $index -gt $(echo "$only" | tr ',' '\n' | sort -n | tail -n1) ]] && break
+    continue
+  fi
   line=$("${gen[@]}" list --seed "$seed" --limit $((index + 1)) | tail -n1 | cut -f2-)
   file=${line%%:*}
   cp "$root/$file" "$work/original"
@@ -147,7 +156,7 @@ while [[ $((killed + survived)) -lt $count && $index -lt $total ]]; do
     failed=" [$failed]"
   fi
   restore
-  echo "$verdict $line$failed ($(($(date +%s) - t0))s)"
+  echo "$verdict $line$failed (#$((index - 1)), $(($(date +%s) - t0))s)"
 done
 
 # Put the build back in step with the restored source.

@@ -87,7 +87,17 @@ TEST_F(Rescan, RemovalCheckCutShortByAStopSendsNoDriveGone) {
 
 // A restart takes the locks a quiesce takes: never amid a quiesce.
 TEST_F(Rescan, RestartWaitsForARescanOrQuiesceInProgress) {
-  EXPECT_TRUE(lockprobe::WaitsForTheSection(&rescanLock, [] { RestartWorkers(); }));
+  // Waiting for the rescan lock, it holds none of the locks taken after it.
+  bool mutexFree = false;
+  EnterCriticalSection(&rescanLock);
+  EXPECT_TRUE(lockprobe::WaitsForTheHeldLock(
+      [] { RestartWorkers(); },
+      [&mutexFree] {
+        mutexFree = WaitForSingleObject(monitorState.stateMutex, 0) == WAIT_OBJECT_0;
+        if (mutexFree) ReleaseMutex(monitorState.stateMutex);
+        LeaveCriticalSection(&rescanLock);
+      }));
+  EXPECT_TRUE(mutexFree) << "the state mutex was taken before the rescan lock";
   EXPECT_TRUE(lockprobe::WaitsForTheSection(&workerStopLock, [] { RestartWorkers(); }));
   EXPECT_EQ(monitorState.stateBlock->channelCount, 0) << "the table was rebuilt";
   EXPECT_EQ(StopWorkers(), 0u);

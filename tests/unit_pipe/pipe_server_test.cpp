@@ -334,7 +334,12 @@ TEST_F(PipeServerTest, DriveCommandsWithoutDrivesAnswerAsNoDrive) {
   Exchange release = Send(client.Get(), *NewCommand(kCommandReleaseDrive, 0));
   EXPECT_EQ(release.Result(), 0u);
   EXPECT_EQ(PublishedStatus(), 102u);
-  // Status and control blocks name a drive that is not in the block.
+  // Status and control blocks name a drive that is not in the block; the one
+  // drive there has a key that is only a prefix of the one named.
+  Locked([this] {
+    Block().driveCount = 1;
+    return static_cast<DWORD>(WideCopy(Block().drives[0].firmwareSerial, 64, WSTR("NO-SUCH")));
+  });
   auto read = NewCommand(kCommandReadStatus);
   const WCHAR serial[] = WSTR("NO-SUCH-DRIVE");
   std::memcpy(read->driveImage + kDriveKeyOffsetInImage, serial, sizeof(serial));
