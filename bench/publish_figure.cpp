@@ -1,23 +1,18 @@
 // The time of one forced publish: the sequence increment and the copy of the
 // block into the mapping through the view the service keeps, under the
 // mutex, as every valid pipe request ends with.
-#include <cstdlib>
 #include <vector>
 
+#include "../tests/unit_monitor/monitor_setup.h"
 #include "figures.h"
-#include "monitor/monitor_state.h"
-#include "platform/win32.h"
-#include "service/process_locks.h"
 
 namespace bench {
 
 void MeasurePublish(const Options& options, double floor, std::vector<Figure>& figures) {
-  InitializeProcessLocks();
-  monitorState = MonitorState{};
-  monitorState.stateMutex = CreateMutexW(nullptr, FALSE, nullptr);
-  monitorState.stateBlock = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));
-  monitorState.fileMapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0,
-                                                kStateBlockSize, nullptr);
+  if (!OpenMonitorState()) {
+    CloseMonitorState();
+    return;
+  }
   const int rounds = options.quick ? 200 : 5000;
   std::vector<double> samples;
   for (int i = 0; i < rounds + 20; ++i) {
@@ -25,10 +20,7 @@ void MeasurePublish(const Options& options, double floor, std::vector<Figure>& f
     PublishStateBlock(nullptr, true);
     if (i >= 20) samples.push_back(NowMicros() - start);
   }
-  CloseStateMapping();
-  CloseHandle(monitorState.stateMutex);
-  std::free(monitorState.stateBlock);
-  monitorState = MonitorState{};
+  CloseMonitorState();
   const double p50 = Percentile(samples, 50);
   figures.push_back({"publish (forced), p50", "us", p50, "floor p50", floor > 0 ? p50 / floor : 0});
 }

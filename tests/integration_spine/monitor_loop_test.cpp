@@ -166,12 +166,23 @@ class MonitorLoop : public ::testing::Test {
   std::unique_ptr<sim::Machine> machine_;
 };
 
-TEST_F(MonitorLoop, WithoutDrivesPublishesAtLeastEveryFifthTick) {
+TEST_F(MonitorLoop, WithoutDrivesPublishesEveryFifthTickAndStopsCleanly) {
+  // What an earlier run in this process may have left behind: a new run
+  // starts from a clean state.
+  monitorState.paused = 1;
+  monitorState.skipTicks = 7;
+  monitorState.tick = 2999;
+  // Threads are checked after every case by the test main's leak check.
+  const long handles = platform::LiveHandleCount();
   Run([](const std::vector<Pass>& passes) {
     if (passes.size() == 23) StopMonitor();
   });
+  // The stop is noticed at the top of the next pass and leaves nothing behind.
   const std::vector<Pass>& passes = observer_.passes;
-  ASSERT_EQ(passes.size(), 23u);
+  ASSERT_EQ(passes.size(), 23u) << "a pass ran after the stop";
+  EXPECT_EQ(monitorState.stateBlock, nullptr);
+  EXPECT_EQ(monitorState.stateMutex, nullptr);
+  EXPECT_EQ(platform::LiveHandleCount(), handles);
   for (const Pass& pass : passes) EXPECT_EQ(pass.kind, PassKind::Regular);
   for (std::size_t i = 5; i < passes.size(); ++i) {
     EXPECT_GT(passes[i].sequence, passes[i - 5].sequence)
@@ -280,19 +291,6 @@ TEST_F(MonitorLoop, RefreshIsPublishedAs101ThenAs102) {
   EXPECT_EQ(after[1], 102u);
   EXPECT_EQ(after.back(), 500u);
   EXPECT_EQ(observer_.passes[2].rescans, observer_.passes[1].rescans + 1);
-}
-
-TEST_F(MonitorLoop, StopIsNoticedAtTheTopOfTheNextPassAndLeavesNothingBehind) {
-  // Threads are checked after every case by the test main's leak check.
-  const long handles = platform::LiveHandleCount();
-  Run([](const std::vector<Pass>& passes) {
-    if (passes.size() == 3) StopMonitor();
-  });
-  EXPECT_EQ(observer_.passes.size(), 3u) << "a pass ran after the stop";
-  EXPECT_EQ(observer_.publishedStatus.back(), 500u);
-  EXPECT_EQ(monitorState.stateBlock, nullptr);
-  EXPECT_EQ(monitorState.stateMutex, nullptr);
-  EXPECT_EQ(platform::LiveHandleCount(), handles);
 }
 
 TEST_F(MonitorLoop, TickWrapsFrom3000To1) {
@@ -489,6 +487,8 @@ TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
     LONG publishedCount = 0;
     std::vector<DWORD> copyCode;
     std::vector<DWORD> ownCode;
+    std::vector<LONG> copyLevel;
+    std::vector<LONG> ownLevel;
   };
   std::vector<Seen> seen;
   Run([&seen](const std::vector<Pass>& passes) {
@@ -500,6 +500,8 @@ TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
       for (LONG p = 0; p < block->publishedCount; ++p) {
         now.copyCode.push_back(block->published[p].statusCode);
         now.ownCode.push_back(block->drives[block->published[p].recordIndex].statusCode);
+        now.copyLevel.push_back(block->published[p].statusLevel);
+        now.ownLevel.push_back(block->drives[block->published[p].recordIndex].statusLevel);
       }
     }
     seen.push_back(now);
@@ -509,8 +511,11 @@ TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
   ASSERT_GE(seen.back().publishedCount, 1);
   for (std::size_t i = 0; i < seen.size(); ++i) {
     EXPECT_EQ(seen[i].copyCode, seen[i].ownCode) << "pass " << i;
+    EXPECT_EQ(seen[i].copyLevel, seen[i].ownLevel) << "pass " << i;
     for (DWORD code : seen[i].copyCode) EXPECT_NE(code, 4u) << "pass " << i;
   }
+  // Every published drive answered its status page: a level of 0 to 3.
+  for (LONG level : seen.back().copyLevel) EXPECT_TRUE(level >= 0 && level <= 3) << level;
 }
 
 }  // namespace

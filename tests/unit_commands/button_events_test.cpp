@@ -9,6 +9,7 @@
 #include "commands_fixture.h"
 #include "support/test_support.h"
 #include "transport/drive_command.h"
+#include "unit_monitor/lock_probe.h"
 
 namespace cmdtest {
 namespace {
@@ -136,6 +137,20 @@ TEST_F(ButtonEventTest, DriverIdentityIsWrittenAsHexadecimalWithinTheLength) {
   EXPECT_EQ(buffer[0], WSTR('#')) << "a length of 1 writes nothing";
   EXPECT_EQ(ReadDriveIdentity(Enclosure(), reinterpret_cast<BYTE*>(buffer), 40), 0u);
   EXPECT_EQ(buffer[0], WSTR('#'));
+}
+
+// Workers read identities while the monitor rebuilds the records: the HID
+// identity is stored, and the driver channel's handle read, under the mutex.
+TEST_F(ButtonEventTest, IdentityReadsWaitForTheStateMutex) {
+  DWORD hid = 0;
+  EXPECT_TRUE(
+      lockprobe::WaitsForTheStateMutex([&] { hid = ReadDriveIdentity(Gauge(), nullptr, 0); }));
+  EXPECT_EQ(hid, 1u);
+  EXPECT_EQ(Narrow(Gauge()->identityText), "374B324139463331");
+  WCHAR buffer[20] = {};
+  EXPECT_TRUE(lockprobe::WaitsForTheStateMutex(
+      [&] { ReadDriveIdentity(FireWire(), reinterpret_cast<BYTE*>(buffer), 34); }));
+  EXPECT_EQ(Narrow(buffer), "1122334455667788");
 }
 
 TEST_F(ButtonEventTest, HidIdentityIsTheSerialStringWhateverTheLength) {

@@ -366,6 +366,21 @@ TEST_F(BindingRulesTest, CreatedRecordsReplaceTheScratchCandidateAndStopAt64) {
   EXPECT_EQ(Block().driveCount, 64);
 }
 
+TEST_F(BindingRulesTest, ChannelsWithoutAPathNeverShareARecord) {
+  ChannelRecord first = MakeChannel(2, 1);
+  first.mayCreateDrive = 1;
+  first.devicePath[0] = 0;
+  WideCopy(first.identityText, 128, WSTR("4142"));
+  ASSERT_EQ(BindChannelToDrive(&first, nullptr, 1), 0);
+  ChannelRecord second = first;
+  second.ownIndex = 6;
+  second.linkedDrive = -1;
+  WideCopy(second.identityText, 128, WSTR("4344"));
+  EXPECT_EQ(BindChannelToDrive(&second, nullptr, 1), 1);
+  EXPECT_EQ(N(Drive(0).serialNumber), "AB");
+  EXPECT_EQ(N(Drive(1).serialNumber), "CD");
+}
+
 TEST_F(BindingRulesTest, FireWireChannelRecordKeepsItsIdentityText) {
   ChannelRecord fireWire = MakeChannel(3, 1);
   fireWire.mayCreateDrive = 1;

@@ -1,6 +1,5 @@
-// The passes of a rescan (enumeration, volume letters, channel scan, and the
-// binding of the channels that need no identity read) on the embedded
-// default machine. Every record is compared byte for byte with a record
+// The passes of a rescan (enumeration, volume letters, channel scan) on the
+// embedded default machine. Every record is compared byte for byte with a record
 // written here from the machine's description: the drives' inquiry data and
 // pages, and the instance IDs and interface paths Windows gives such devices.
 #include <gtest/gtest.h>
@@ -8,7 +7,6 @@
 #include <cstring>
 #include <string>
 
-#include "discovery/channel_binding.h"
 #include "discovery/channel_scan.h"
 #include "discovery/drive_enumeration.h"
 #include "discovery_fixture.h"
@@ -18,9 +16,6 @@ namespace disctest {
 namespace {
 
 constexpr char kDiskClass[] = "#{53f56307-b6bf-11d0-94f2-00a0c91efb8b}";
-constexpr char kHidClass[] = "#{4d1e55b2-f16f-11cf-88cb-001111000030}";
-constexpr char kClassA[] = "#{6b1e0c27-5a94-4d3b-9f10-2c7e8a41d5b3}";
-constexpr char kClassC[] = "#{1d9c4e6a-73b2-4f05-a6e8-5b20c9d41f7e}";
 
 // Offset of the first byte that differs, -1 when none does.
 long FirstDifference(const void* a, const void* b, std::size_t size) {
@@ -35,11 +30,6 @@ long FirstDifference(const void* a, const void* b, std::size_t size) {
 template <std::size_t N>
 void Set(WCHAR (&field)[N], const std::string& text) {
   WideCopy(field, N, W(text));
-}
-
-void SetLetters(ChannelRecord* channel, const std::string& letters) {
-  const WideString wide = W(letters);
-  std::memcpy(channel->volumeLetters, wide.data(), wide.size() * sizeof(WCHAR));
 }
 
 std::string Lower(std::string text) {
@@ -88,11 +78,6 @@ void ExpectSameDrive(const DriveRecord& actual, DriveRecord expected, const std:
   expected.modelSuffixRef = actual.modelSuffixRef;
   expected.productLineRef = actual.productLineRef;
   EXPECT_EQ(FirstDifference(&actual, &expected, sizeof(DriveRecord)), -1) << name;
-}
-
-void ExpectSameChannel(const ChannelRecord& actual, const ChannelRecord& expected,
-                       const std::string& name) {
-  EXPECT_EQ(FirstDifference(&actual, &expected, sizeof(ChannelRecord)), -1) << name;
 }
 
 std::string RefText(const WCHAR* ref) {
@@ -205,77 +190,8 @@ TEST_F(DefaultMachineTest, RescanPassesFillEveryRecordAsTheDescriptionSays) {
   EXPECT_EQ(RefText(Drive(3).productLineRef), "Rambler");
   ExpectSameDrive(Drive(3), enclosure, "enclosure");
 
-  // ---- channels: the HID class first, then vendor classes A, B and C ----
-  ChannelRecord gaugeHid{};
-  gaugeHid.kind = 2;
-  gaugeHid.linkedDrive = -1;
-  gaugeHid.ownIndex = 0;
-  gaugeHid.mode = 1;  // standalone gauge model
-  gaugeHid.mayCreateDrive = 1;
-  Set(gaugeHid.deviceInstanceId, "HID\\VID_1A2B&PID_7B44&MI_01\\7&31413000&0&0000");
-  Set(gaugeHid.serialKey, gaugeSerial);
-  Set(gaugeHid.devicePath,
-      std::string("\\\\?\\hid#vid_1a2b&pid_7b44&mi_01#7&31413000&0&0000") + kHidClass);
-  ExpectSameChannel(Channel(0), gaugeHid, "gauge HID");
-
-  ChannelRecord plainHid{};
-  plainHid.kind = 2;
-  plainHid.linkedDrive = -1;
-  plainHid.ownIndex = 1;
-  Set(plainHid.deviceInstanceId, "HID\\VID_1A2B&PID_2A31&MI_01\\7&31413001&0&0000");
-  Set(plainHid.serialKey, plainSerial);
-  Set(plainHid.devicePath,
-      std::string("\\\\?\\hid#vid_1a2b&pid_2a31&mi_01#7&31413001&0&0000") + kHidClass);
-  ExpectSameChannel(Channel(1), plainHid, "plain HID");
-
-  ChannelRecord driver{};
-  driver.kind = 3;
-  driver.linkedDrive = -1;
-  driver.ownIndex = 2;
-  driver.mayCreateDrive = 1;
-  Set(driver.deviceInstanceId, "1394\\QX&EXTERNAL_HDD\\0030E0000001A2B3");
-  Set(driver.instanceTail, "0030E0000001A2B3");
-  Set(driver.serialKey, "000E0300");
-  Set(driver.devicePath, std::string("\\\\?\\1394#qx&external_hdd#0030e0000001a2b3") + kClassA);
-  ExpectSameChannel(Channel(2), driver, "firewire driver");
-
-  ChannelRecord ses{};
-  ses.kind = 3;
-  ses.linkedDrive = -1;
-  ses.ownIndex = 3;
-  ses.mode = 2;
-  ses.mayCreateDrive = 1;
-  Set(ses.deviceInstanceId, "SBP2\\QX&QUARRY_SES&LUN1\\0030E00000045D6F");
-  Set(ses.instanceTail, "0030E00000045D6F");
-  Set(ses.serialKey, "000E0300");
-  Set(ses.devicePath, std::string("\\\\?\\sbp2#qx&quarry_ses&lun1#0030e00000045d6f") + kClassC);
-  Set(ses.controlPath, std::string("\\\\?\\sbp2#qx&quarry_ses&lun1#0030e00000045d6f") + kClassC);
-  ExpectSameChannel(Channel(3), ses, "enclosure services");
-
-  // ---- binding the two IEEE 1394 channels, which need no identity read ----
-  ASSERT_EQ(BindChannelToDrive(&Channel(2), nullptr, 1), 2);
-  ASSERT_EQ(BindChannelToDrive(&Channel(3), nullptr, 1), 3);
-  EXPECT_EQ(Block().driveCount, 4);
-
-  fireWire.channelIndex = 2;
-  Set(fireWire.channelPath, N(driver.devicePath));
-  Set(fireWire.hidPath, N(driver.devicePath));
-  ExpectSameDrive(Drive(2), fireWire, "firewire bound");
-  driver.linkedDrive = 2;
-  Set(driver.diskPath, N(fireWire.diskPath));
-  SetLetters(&driver, "H");
-  ExpectSameChannel(Channel(2), driver, "firewire driver bound");
-
-  enclosure.channelIndex = 3;
-  enclosure.channelMode = 2;
-  Set(enclosure.channelPath, N(ses.devicePath));
-  Set(enclosure.hidPath, N(ses.devicePath));
-  Set(enclosure.controlPath, N(ses.controlPath));
-  ExpectSameDrive(Drive(3), enclosure, "enclosure bound");
-  ses.linkedDrive = 3;
-  Set(ses.diskPath, N(enclosure.diskPath));
-  SetLetters(&ses, "I");
-  ExpectSameChannel(Channel(3), ses, "enclosure services bound");
+  // The channel records and their binding are ChannelTest's, on machines
+  // built for each rule, and WorkersTest links every channel of this one.
 }
 
 }  // namespace

@@ -140,6 +140,7 @@ TEST_F(EnumerationTest, UsbDiskNeedsAModelSuffixInItsParent) {
   orphan.asciiInfo1 = "ORPHAN INFO";
   sim::DriveSpec plain = UsbDrive("plain", "2A31", "504C4149");
   plain.rcsIdentity = false;  // no extended identity: no vendor pages read
+  plain.modelCode = "2A34";   // the inquiry names another row than the parent
   machine_.AddDrive(orphan);
   machine_.AddDrive(plain);
   Install();

@@ -37,22 +37,6 @@ TEST(ModelTableTest, BareCodesAndInstanceIdsSelectTheirRows) {
   EXPECT_EQ(untouched.flags, 7u);
 }
 
-TEST(ModelTableTest, TableHasNineteenRowsAndAnEndRow) {
-  const char* const suffixes[kModelRowCount] = {
-      "_2A30", "_2A31", "_2A34", "_2A35", "_2A37", "_2A39", "_5E21", "_5E22", "_5E23", "_5E24",
-      "_5E25", "_7B41", "_7B42", "_7B43", "_7B44", "_7B45", "_3C12", "_3C13", "_3C14"};
-  const DWORD segments[kModelRowCount] = {0, 0, 0, 0, 0, 0, 6, 6, 6, 6, 6, 4, 4, 6, 4, 6, 4, 4, 4};
-  for (int i = 0; i < kModelRowCount; ++i) {
-    const ModelRow& row = kModelTable[i];
-    EXPECT_EQ(WideToUtf8(WideView(row.suffix, WideLength(row.suffix))), suffixes[i]) << i;
-    EXPECT_EQ(row.gaugeSegments, segments[i]) << i;
-    const DWORD flags = i == 9 ? 0x10u : (i == 14 || i == 15) ? 0x30u : 0u;
-    EXPECT_EQ(row.flags, flags) << i;
-    EXPECT_EQ(row.productLine != nullptr, i >= 16) << i;
-  }
-  EXPECT_EQ(kModelTable[kModelRowCount].suffix[0], 0);
-}
-
 TEST(ModelTableTest, ChannelAndStandaloneLists) {
   EXPECT_TRUE(IsChannelModel(WSTR("HID\\VID_1A2B&PID_3C13&MI_01\\7&2&0&0000")));  // contains "C13"
   EXPECT_FALSE(IsStandaloneChannelModel(WSTR("HID\\VID_1A2B&PID_3C13&MI_01\\7&2&0&0000")));

@@ -1,7 +1,8 @@
 // A machine with a drive of each channel kind and mode, the monitor state a
-// running service has (mutex held by the test thread, working block), the
-// channel records as a rescan builds and binds them, and each channel's
-// shared handle opened as the worker starter opens it.
+// running service has (mutex, working block, stop events), the channel
+// records as a rescan builds them and each channel's shared handle opened as
+// the worker starter opens it. MachineTest is shared with unit_commands;
+// FeatureTest adds the binding and holds the state mutex.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -32,7 +33,8 @@ constexpr std::uint64_t kMiB = 1ull << 20;
 
 using testsupport::Narrow;
 
-inline sim::VolumeSpec Volume(char letter, std::uint64_t sizeMiB, std::uint64_t freeMiB) {
+inline sim::VolumeSpec Volume(char letter, std::uint64_t sizeMiB = 1000,
+                              std::uint64_t freeMiB = 500) {
   sim::VolumeSpec volume;
   volume.letter = letter;
   volume.sizeBytes = sizeMiB * kMiB;
@@ -67,53 +69,104 @@ inline sim::DriveSpec FireWireDrive(const std::string& name, sim::ChannelKind ch
   return spec;
 }
 
-class FeatureTest : public ::testing::Test {
- protected:
-  // Lets a case change a drive before the machine is installed.
-  virtual void Customize(std::vector<sim::DriveSpec>* /*drives*/) {}
+// gauge: HID of a standalone gauge model (mode 1), two 1000 MiB volumes with
+// 250 and 750 MiB free; plain: HID of a model outside the channel list (mode
+// 0); firewire: button filter driver (mode 0); lights: button filter driver
+// of a unit with lights (mode 1); enclosure: IEEE 1394 enclosure services
+// (mode 2).
+inline std::vector<sim::DriveSpec> OneDriveOfEachKind() {
+  std::vector<sim::DriveSpec> drives = {
+      UsbHidDrive("gauge", "7B44", "QX-7K2A9F31", {Volume('E', 1000, 250), Volume('K', 1000, 750)}),
+      UsbHidDrive("plain", "2A31", "QX-5M8B2D07", {Volume('F')}),
+      FireWireDrive("firewire", sim::ChannelKind::Driver, "EXTERNAL_HDD", "0030E0000001A2B3",
+                    {Volume('H')}),
+      FireWireDrive("lights", sim::ChannelKind::Driver, "EXTERNAL_LIGHTS", "0030E0000002C4D5",
+                    {Volume('J')}),
+      FireWireDrive("enclosure", sim::ChannelKind::Enclosure, "QUARRY", "0030E00000045D6F",
+                    {Volume('I')}),
+  };
+  drives.back().modelCode = "3C13";
+  return drives;
+}
 
-  void SetUp() override {
+// The machine `M` with `drives` installed, the rescan passes run and every
+// channel's shared handle open.
+template <typename M>
+class MachineTest : public ::testing::Test {
+ protected:
+  void Start(const std::vector<sim::DriveSpec>& drives, int channels) {
     InitializeProcessLocks();
     ForgetRefreshConditions();
     monitorState = MonitorState{};
     monitorState.tick = 1;
     monitorState.osKind = kOsXpOrLater;
     monitorState.stateMutex = CreateMutexW(nullptr, FALSE, nullptr);
-    monitorState.stopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
     monitorState.workerStopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
     block_.reset(static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock))));
     monitorState.stateBlock = block_.get();
-    // The callers of every procedure here hold the state mutex.
-    ASSERT_EQ(WaitForSingleObject(monitorState.stateMutex, 0), WAIT_OBJECT_0);
-
-    // gauge: HID of a standalone gauge model (mode 1), two 1000 MiB volumes
-    // with 250 and 750 MiB free; plain: HID of a model outside the channel
-    // list (mode 0); firewire: button filter driver (mode 0); lights: button
-    // filter driver of a unit with lights (mode 1); enclosure: IEEE 1394
-    // enclosure services (mode 2).
-    std::vector<sim::DriveSpec> drives = {
-        UsbHidDrive("gauge", "7B44", "QX-7K2A9F31",
-                    {Volume('E', 1000, 250), Volume('K', 1000, 750)}),
-        UsbHidDrive("plain", "2A31", "QX-5M8B2D07", {Volume('F', 1000, 500)}),
-        FireWireDrive("firewire", sim::ChannelKind::Driver, "EXTERNAL_HDD", "0030E0000001A2B3",
-                      {Volume('H', 1000, 500)}),
-        FireWireDrive("lights", sim::ChannelKind::Driver, "EXTERNAL_LIGHTS", "0030E0000002C4D5",
-                      {Volume('J', 1000, 500)}),
-        FireWireDrive("enclosure", sim::ChannelKind::Enclosure, "QUARRY", "0030E00000045D6F",
-                      {Volume('I', 1000, 500)}),
-    };
-    drives.back().modelCode = "3C13";
-    Customize(&drives);
     for (const sim::DriveSpec& drive : drives) machine_.AddDrive(drive);
     machine_.Install();
-
     EnumerateDrives(nullptr);
     AssignVolumeLetters();
     RebuildChannelTable();
-    ASSERT_EQ(Block().channelCount, 5);
+    ASSERT_EQ(Block().channelCount, channels);
+    for (int i = 0; i < channels; ++i) OpenShared(&Block().channels[i]);
+    machine_.ClearCommands();
+  }
+
+  void TearDown() override {
+    testsupport::CloseChannelHandles(Block());
+    machine_.WaitForDeviceEvents();
+    machine_.Uninstall();
+    for (HANDLE handle : {monitorState.workerStopEvent, monitorState.stopEvent}) {
+      if (handle != nullptr) CloseHandle(handle);
+    }
+    CloseHandle(monitorState.stateMutex);
+    monitorState = MonitorState{};
+  }
+
+  static void OpenShared(ChannelRecord* channel) { testsupport::OpenSharedChannelHandle(channel); }
+  StateBlock& Block() { return *block_; }
+  ChannelRecord* Channel(const std::string& part) {
+    return testsupport::FindChannel(Block(), part);
+  }
+  ChannelRecord* Gauge() { return Channel("pid_7b44"); }
+  ChannelRecord* Plain() { return Channel("pid_2a31"); }
+  ChannelRecord* FireWire() { return Channel("external_hdd#"); }
+  ChannelRecord* Lights() { return Channel("external_lights#"); }
+  ChannelRecord* Enclosure() { return Channel("_ses"); }
+
+  // What the drive received of one kind, in order.
+  std::vector<sim::Command> Sent(const std::string& drive, Kind kind) {
+    std::vector<sim::Command> out;
+    for (const sim::Command& command : machine_.Commands(drive)) {
+      if (command.kind == kind) out.push_back(command);
+    }
+    return out;
+  }
+
+  struct FreeBlock {
+    void operator()(StateBlock* block) const { std::free(block); }
+  };
+  std::unique_ptr<StateBlock, FreeBlock> block_;
+  M machine_;
+};
+
+class FeatureTest : public MachineTest<sim::Machine> {
+ protected:
+  // Lets a case change a drive before the machine is installed.
+  virtual void Customize(std::vector<sim::DriveSpec>* /*drives*/) {}
+
+  void SetUp() override {
+    std::vector<sim::DriveSpec> drives = OneDriveOfEachKind();
+    Customize(&drives);
+    Start(drives, 5);
+    if (HasFatalFailure()) return;
+    monitorState.stopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+    // The callers of every procedure here hold the state mutex.
+    ASSERT_EQ(WaitForSingleObject(monitorState.stateMutex, 0), WAIT_OBJECT_0);
     for (int i = 0; i < Block().channelCount; ++i) {
       ChannelRecord& channel = Block().channels[i];
-      OpenShared(&channel);
       // HID channels are matched by the serial string their worker reads.
       if (channel.kind == kChannelKindHid) {
         ASSERT_EQ(ReadDriveIdentity(&channel, nullptr, 0), 1u);
@@ -129,28 +182,9 @@ class FeatureTest : public ::testing::Test {
   }
 
   void TearDown() override {
-    testsupport::CloseChannelHandles(Block());
-    machine_.WaitForDeviceEvents();
-    machine_.Uninstall();
     ReleaseMutex(monitorState.stateMutex);
-    CloseHandle(monitorState.workerStopEvent);
-    CloseHandle(monitorState.stopEvent);
-    CloseHandle(monitorState.stateMutex);
-    monitorState = MonitorState{};
+    MachineTest::TearDown();
   }
-
-  static void OpenShared(ChannelRecord* channel) { testsupport::OpenSharedChannelHandle(channel); }
-
-  StateBlock& Block() { return *block_; }
-
-  ChannelRecord* Channel(const std::string& part) {
-    return testsupport::FindChannel(Block(), part);
-  }
-  ChannelRecord* Gauge() { return Channel("pid_7b44"); }
-  ChannelRecord* Plain() { return Channel("pid_2a31"); }
-  ChannelRecord* FireWire() { return Channel("external_hdd#"); }
-  ChannelRecord* Lights() { return Channel("external_lights#"); }
-  ChannelRecord* Enclosure() { return Channel("_ses"); }
 
   // The working drive record the channel is linked to, and a private copy.
   DriveRecord& Working(const ChannelRecord* channel) {
@@ -158,14 +192,6 @@ class FeatureTest : public ::testing::Test {
   }
   DriveRecord CopyOf(const ChannelRecord* channel) { return Working(channel); }
 
-  // What the drive received of one kind, in order.
-  std::vector<sim::Command> Sent(const std::string& drive, Kind kind) {
-    std::vector<sim::Command> out;
-    for (const sim::Command& command : machine_.Commands(drive)) {
-      if (command.kind == kind) out.push_back(command);
-    }
-    return out;
-  }
   // Value bytes of the HID output reports written (report ID stripped).
   std::vector<Bytes> HidValues(const std::string& drive) {
     std::vector<Bytes> out;
@@ -182,12 +208,6 @@ class FeatureTest : public ::testing::Test {
     }
     return out;
   }
-
-  struct FreeBlock {
-    void operator()(StateBlock* block) const { std::free(block); }
-  };
-  std::unique_ptr<StateBlock, FreeBlock> block_;
-  sim::Machine machine_;
 };
 
 }  // namespace featuretest

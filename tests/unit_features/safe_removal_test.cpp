@@ -76,7 +76,9 @@ TEST_F(SafeRemovalTest, WithoutABoundDriveNothingIsTouched) {
   ASSERT_GE(BindChannelToDrive(gauge, &made, 1), 0);
   ASSERT_EQ(made.fromChannel, 1u);
   EXPECT_EQ(EjectDriveDevice(&made, gauge), 0);
+  EXPECT_EQ(GetLastError(), DWORD{ERROR_NOT_FOUND});
   EXPECT_EQ(SafeRemoveDrive(&made, gauge), 0);
+  EXPECT_EQ(GetLastError(), DWORD{ERROR_NOT_FOUND}) << "the detail the client is sent";
   EXPECT_TRUE(machine_.Ejects().empty());
   EXPECT_TRUE(HidValues("gauge").empty()) << "no drive-gone command";
   EXPECT_TRUE(machine_.Attached("gauge"));

@@ -1,7 +1,9 @@
 #include "volume/device_events.h"
 
+#include <utility>
 #include <vector>
 
+#include "lock_probe.h"
 #include "monitor_fixture.h"
 #include "platform/wide.h"
 #include "service/interface_classes.h"
@@ -42,62 +44,71 @@ class DeviceEvents : public MonitorFixture {
     return {after.refreshRequests - before.refreshRequests, after.driveListStale,
             after.deviceChangePending, after.removalCheckRequested};
   }
-  void Reset() {
-    monitorState.driveListStale = monitorState.deviceChangePending =
-        monitorState.removalCheckRequested = 0;
-  }
 };
 
-TEST_F(DeviceEvents, VolumeEvents) {
+// Each row: the event, its record, and what it asks for (refreshes added,
+// then the three flags), starting from clear flags.
+TEST_F(DeviceEvents, EachEventAsksForWhatItsKindNeeds) {
   DEV_BROADCAST_HDR volume = {};
   volume.dbch_size = sizeof(volume);
   volume.dbch_devicetype = DBT_DEVTYP_VOLUME;
-  EXPECT_EQ(Handle(DBT_DEVICEARRIVAL, &volume), (Requests{1, 1, 0, 0}));
-  Reset();
-  EXPECT_EQ(Handle(DBT_DEVICEREMOVECOMPLETE, &volume), (Requests{0, 1, 0, 1}));
-}
-
-TEST_F(DeviceEvents, StorageAndUsbInterfaces) {
-  InterfaceEvent disk = Interface(kDiskInterfaceClass);
-  EXPECT_EQ(Handle(DBT_DEVICEARRIVAL, &disk), (Requests{1, 0, 0, 0}));
-  EXPECT_EQ(Handle(DBT_DEVICEREMOVECOMPLETE, &disk), (Requests{0, 1, 0, 1}));
-  Reset();
-  InterfaceEvent volume = Interface(kVolumeInterfaceClass);
-  EXPECT_EQ(Handle(DBT_DEVICEREMOVECOMPLETE, &volume), (Requests{0, 1, 0, 1}));
-  Reset();
-  InterfaceEvent usb = Interface(kUsbDeviceInterfaceClass);
-  EXPECT_EQ(Handle(DBT_DEVICEARRIVAL, &usb), (Requests{0, 1, 1, 0}));
-  Reset();
-  EXPECT_EQ(Handle(DBT_DEVICEREMOVECOMPLETE, &usb), (Requests{0, 1, 1, 0}));
-}
-
-TEST_F(DeviceEvents, DriveControlInterfacesByClassOrName) {
   GUID hidClass;
   ASSERT_TRUE(GetHidClassGuid(&hidClass));
-  InterfaceEvent hid = Interface(hidClass);
-  EXPECT_EQ(Handle(DBT_DEVICEARRIVAL, &hid), (Requests{1, 0, 0, 0}));
-  InterfaceEvent vendor = Interface(kVendorClassB);
-  EXPECT_EQ(Handle(DBT_DEVICEREMOVECOMPLETE, &vendor), (Requests{0, 0, 0, 1}));
-  Reset();
+  const InterfaceEvent disk = Interface(kDiskInterfaceClass);
+  const InterfaceEvent volumeInterface = Interface(kVolumeInterfaceClass);
+  const InterfaceEvent usb = Interface(kUsbDeviceInterfaceClass);
+  const InterfaceEvent hid = Interface(hidClass);
+  const InterfaceEvent vendor = Interface(kVendorClassB);
   // The name test comes before the storage classes and is case-sensitive.
-  InterfaceEvent named = Interface(kDiskInterfaceClass, WSTR("\\\\?\\scsi#SES_dev"));
-  EXPECT_EQ(Handle(DBT_DEVICEREMOVECOMPLETE, &named), (Requests{0, 0, 0, 1}));
-  Reset();
-  InterfaceEvent lower = Interface(kUsbDeviceInterfaceClass, WSTR("\\\\?\\quarry#ses"));
-  EXPECT_EQ(Handle(DBT_DEVICEARRIVAL, &lower), (Requests{0, 1, 1, 0}));
+  const InterfaceEvent named = Interface(kDiskInterfaceClass, WSTR("\\\\?\\scsi#SES_dev"));
+  const InterfaceEvent lower = Interface(kUsbDeviceInterfaceClass, WSTR("\\\\?\\quarry#ses"));
+  const InterfaceEvent other = Interface(GUID{0x12345678, 1, 2, {3, 4, 5, 6, 7, 8, 9, 10}});
+  const struct {
+    const char* what;
+    DWORD type;
+    const void* record;
+    Requests expected;
+  } cases[] = {
+      {"volume arrival", DBT_DEVICEARRIVAL, &volume, {1, 1, 0, 0}},
+      {"volume removal", DBT_DEVICEREMOVECOMPLETE, &volume, {0, 1, 0, 1}},
+      {"disk arrival", DBT_DEVICEARRIVAL, &disk, {1, 0, 0, 0}},
+      {"disk removal", DBT_DEVICEREMOVECOMPLETE, &disk, {0, 1, 0, 1}},
+      {"volume interface removal", DBT_DEVICEREMOVECOMPLETE, &volumeInterface, {0, 1, 0, 1}},
+      {"usb arrival", DBT_DEVICEARRIVAL, &usb, {0, 1, 1, 0}},
+      {"usb removal", DBT_DEVICEREMOVECOMPLETE, &usb, {0, 1, 1, 0}},
+      {"hid arrival", DBT_DEVICEARRIVAL, &hid, {1, 0, 0, 0}},
+      {"vendor class removal", DBT_DEVICEREMOVECOMPLETE, &vendor, {0, 0, 0, 1}},
+      {"SES name removal", DBT_DEVICEREMOVECOMPLETE, &named, {0, 0, 0, 1}},
+      {"lower-case ses name", DBT_DEVICEARRIVAL, &lower, {0, 1, 1, 0}},
+      {"query remove", DBT_DEVICEQUERYREMOVE, &disk, {0, 0, 0, 0}},
+      {"nodes changed", DBT_DEVNODES_CHANGED, nullptr, {0, 0, 0, 0}},
+      {"unknown class", DBT_DEVICEARRIVAL, &other, {0, 0, 0, 0}},
+      // Forwarded by the application: the record is never read.
+      {"forwarded arrival", DBT_DEVICEARRIVAL, nullptr, {1, 0, 0, 0}},
+      {"forwarded removal", DBT_DEVICEREMOVECOMPLETE, nullptr, {0, 0, 0, 1}},
+  };
+  for (const auto& c : cases) {
+    monitorState.driveListStale = monitorState.deviceChangePending =
+        monitorState.removalCheckRequested = 0;
+    EXPECT_EQ(Handle(c.type, c.record), c.expected) << c.what;
+  }
 }
 
-TEST_F(DeviceEvents, OtherEventsAndUnknownClassesAreIgnored) {
-  InterfaceEvent disk = Interface(kDiskInterfaceClass);
-  EXPECT_EQ(Handle(DBT_DEVICEQUERYREMOVE, &disk), (Requests{0, 0, 0, 0}));
-  EXPECT_EQ(Handle(DBT_DEVNODES_CHANGED, nullptr), (Requests{0, 0, 0, 0}));
-  InterfaceEvent other = Interface(GUID{0x12345678, 1, 2, {3, 4, 5, 6, 7, 8, 9, 10}});
-  EXPECT_EQ(Handle(DBT_DEVICEARRIVAL, &other), (Requests{0, 0, 0, 0}));
-}
-
-TEST_F(DeviceEvents, ForwardedEventWithoutRecordIsHandledWithoutReadingIt) {
-  EXPECT_EQ(Handle(DBT_DEVICEARRIVAL, nullptr), (Requests{1, 0, 0, 0}));
-  EXPECT_EQ(Handle(DBT_DEVICEREMOVECOMPLETE, nullptr), (Requests{0, 0, 0, 1}));
+// The flags are the monitor's: every path that sets them waits for the mutex.
+TEST_F(DeviceEvents, FlagsAreSetUnderTheStateMutex) {
+  DEV_BROADCAST_HDR volume = {};
+  volume.dbch_size = sizeof(volume);
+  volume.dbch_devicetype = DBT_DEVTYP_VOLUME;
+  const InterfaceEvent disk = Interface(kDiskInterfaceClass);
+  const InterfaceEvent usb = Interface(kUsbDeviceInterfaceClass);
+  const std::pair<DWORD, const void*> events[] = {{DBT_DEVICEREMOVECOMPLETE, &volume},
+                                                  {DBT_DEVICEREMOVECOMPLETE, &disk},
+                                                  {DBT_DEVICEARRIVAL, &usb}};
+  for (const auto& [type, record] : events) {
+    EXPECT_TRUE(lockprobe::WaitsForTheStateMutex([&] { HandleDeviceEvent(type, record, nullptr); }))
+        << type;
+  }
+  EXPECT_EQ(Current(), (Requests{0, 1, 1, 1}));
 }
 
 }  // namespace

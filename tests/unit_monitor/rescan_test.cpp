@@ -1,7 +1,9 @@
 #include "monitor/rescan.h"
 
+#include "lock_probe.h"
 #include "monitor/channel_workers.h"
 #include "monitor_fixture.h"
+#include "service/process_locks.h"
 
 namespace {
 
@@ -81,6 +83,24 @@ TEST_F(Rescan, RemovalCheckCutShortByAStopSendsNoDriveGone) {
   EXPECT_EQ(monitorState.skipTicks, 0u);
   monitorState.stopEvent = nullptr;
   CloseHandle(stop);
+}
+
+// A restart takes the locks a quiesce takes: never amid a quiesce.
+TEST_F(Rescan, RestartWaitsForARescanOrQuiesceInProgress) {
+  // Waiting for the rescan lock, it holds none of the locks taken after it.
+  bool mutexFree = false;
+  EnterCriticalSection(&rescanLock);
+  EXPECT_TRUE(lockprobe::WaitsForTheHeldLock(
+      [] { RestartWorkers(); },
+      [&mutexFree] {
+        mutexFree = WaitForSingleObject(monitorState.stateMutex, 0) == WAIT_OBJECT_0;
+        if (mutexFree) ReleaseMutex(monitorState.stateMutex);
+        LeaveCriticalSection(&rescanLock);
+      }));
+  EXPECT_TRUE(mutexFree) << "the state mutex was taken before the rescan lock";
+  EXPECT_TRUE(lockprobe::WaitsForTheSection(&workerStopLock, [] { RestartWorkers(); }));
+  EXPECT_EQ(monitorState.stateBlock->channelCount, 0) << "the table was rebuilt";
+  EXPECT_EQ(StopWorkers(), 0u);
 }
 
 TEST_F(Rescan, StopWorkersWithNoneRunningOnlySets102) {

@@ -4,6 +4,7 @@
 #include <cstring>
 
 #include "pipe/pipe_server.h"
+#include "unit_monitor/monitor_setup.h"
 
 // The client's quality-of-service flags are the system's own values (the
 // emulation has no impersonation, so the values are checked where the system
@@ -15,27 +16,14 @@ static_assert(kPipeClientSecurityFlags == (SECURITY_SQOS_PRESENT | SECURITY_IDEN
 namespace pipetest {
 
 void MonitorFixture::SetUp() {
-  monitorState = MonitorState{};
-  block_ = std::make_unique<StateBlock>();
-  std::memset(static_cast<void*>(block_.get()), 0, sizeof(StateBlock));
-  monitorState.stateBlock = block_.get();
-  monitorState.stateMutex = CreateMutexW(nullptr, FALSE, nullptr);
-  monitorState.fileMapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0,
-                                                kStateBlockSize, nullptr);
+  ASSERT_TRUE(OpenMonitorState());
   monitorState.pipeStopEvent = CreateEventW(nullptr, FALSE, FALSE, nullptr);
-  ASSERT_NE(monitorState.stateMutex, nullptr);
-  ASSERT_NE(monitorState.fileMapping, nullptr);
   ASSERT_NE(monitorState.pipeStopEvent, nullptr);
 }
 
 void MonitorFixture::TearDown() {
-  CloseStateMapping();
-  for (HANDLE* handle : {&monitorState.stateMutex, &monitorState.pipeStopEvent}) {
-    if (*handle != nullptr) CloseHandle(*handle);
-    *handle = nullptr;
-  }
-  monitorState.stateBlock = nullptr;
-  block_.reset();
+  if (monitorState.pipeStopEvent != nullptr) CloseHandle(monitorState.pipeStopEvent);
+  CloseMonitorState();
 }
 
 std::unique_ptr<StateBlock> MonitorFixture::Published() {

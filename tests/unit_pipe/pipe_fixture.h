@@ -26,12 +26,9 @@ class MonitorFixture : public ::testing::Test {
   void SetUp() override;
   void TearDown() override;
 
-  StateBlock& Block() { return *block_; }
+  StateBlock& Block() { return *monitorState.stateBlock; }
   // A copy of the block as last published into the mapping.
   std::unique_ptr<StateBlock> Published();
-
- private:
-  std::unique_ptr<StateBlock> block_;
 };
 
 // The same with the pipe server thread running.

@@ -16,9 +16,7 @@
 #include "pipe/pipe_instance.h"
 #include "pipe_fixture.h"
 #include "platform/wide.h"
-#ifdef _WIN32
-#include <aclapi.h>
-#else
+#ifndef _WIN32
 #include "platform/posix/emu_scm.h"
 #endif
 #include "support/test_support.h"
@@ -336,7 +334,12 @@ TEST_F(PipeServerTest, DriveCommandsWithoutDrivesAnswerAsNoDrive) {
   Exchange release = Send(client.Get(), *NewCommand(kCommandReleaseDrive, 0));
   EXPECT_EQ(release.Result(), 0u);
   EXPECT_EQ(PublishedStatus(), 102u);
-  // Status and control blocks name a drive that is not in the block.
+  // Status and control blocks name a drive that is not in the block; the one
+  // drive there has a key that is only a prefix of the one named.
+  Locked([this] {
+    Block().driveCount = 1;
+    return static_cast<DWORD>(WideCopy(Block().drives[0].firmwareSerial, 64, WSTR("NO-SUCH")));
+  });
   auto read = NewCommand(kCommandReadStatus);
   const WCHAR serial[] = WSTR("NO-SUCH-DRIVE");
   std::memcpy(read->driveImage + kDriveKeyOffsetInImage, serial, sizeof(serial));
@@ -379,17 +382,6 @@ TEST_F(PipeServerTest, RegistryThroughThePipeReportsNeededSize) {
   std::memcpy(&answer, whole.reply.data(), sizeof(answer));
   EXPECT_EQ(answer.registry.valueType, static_cast<DWORD>(REG_BINARY));
   EXPECT_EQ(std::memcmp(RegistryData(&answer), data.data(), data.size()), 0);
-
-  // Declared in full but cut inside the value name: refused, nothing written.
-  auto cut = NewCommand(kCommandRegistry);
-  ASSERT_TRUE(LayOutRegistryRequest(cut.get(), RootKeyValue(HKEY_CURRENT_USER), path.c_str(),
-                                    WSTR("CutName"), kRegistrySet, REG_BINARY, data.data(), 4));
-  const DWORD cutAt =
-      static_cast<DWORD>(offsetof(CommandMessage, registryText) + cut->registry.nameOffset + 4);
-  Exchange refused = Send(client.Get(), cut.get(), cutAt);
-  EXPECT_EQ(refused.Result(), static_cast<DWORD>(ERROR_INVALID_PARAMETER));
-  EXPECT_EQ(refused.reply.size(), sizeof(CommandMessage));
-  EXPECT_FALSE(testKey.HasValue(WSTR("CutName")));
 }
 
 // Before major version 6 the pipe's DACL denies the network logon SID, then
@@ -446,26 +438,6 @@ TEST(PipeSecurityTest, NetworkDeniedBeforeVersionSixRemoteFlagFromSix) {
                          PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | security.pipeModeFlags, 1, 64,
                          64, 0, &security.attributes));
     ASSERT_TRUE(server) << GetLastError();
-#ifdef _WIN32
-    // The system keeps the ACEs on the pipe in the same order.
-    PACL applied = nullptr;
-    PSECURITY_DESCRIPTOR descriptor = nullptr;
-    ASSERT_EQ(GetSecurityInfo(server.Get(), SE_KERNEL_OBJECT, DACL_SECURITY_INFORMATION, nullptr,
-                              nullptr, &applied, nullptr, &descriptor),
-              static_cast<DWORD>(ERROR_SUCCESS));
-    if (major < 6) {
-      ASSERT_NE(applied, nullptr);
-      ASSERT_EQ(applied->AceCount, 2u);
-      for (DWORD i = 0; i < 2; ++i) {
-        LPVOID ace = nullptr;
-        ASSERT_TRUE(GetAce(applied, i, &ace));
-        auto* entry = static_cast<ACCESS_ALLOWED_ACE*>(ace);
-        EXPECT_EQ(entry->Header.AceType, expected[i].type) << i;
-        EXPECT_TRUE(EqualSid(&entry->SidStart, expected[i].sid)) << i;
-      }
-    }
-    LocalFree(descriptor);
-#endif
     Handle client(
         CreateFileW(name, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr));
     EXPECT_TRUE(client) << GetLastError();

@@ -1,8 +1,10 @@
 #include <gtest/gtest.h>
 
 #include "platform/wide.h"
+#include "service/process_locks.h"
 #include "service/service_host.h"
 #include "service/service_main.h"
+#include "unit_monitor/lock_probe.h"
 
 namespace {
 
@@ -56,6 +58,30 @@ TEST(ReportServiceStatus, DebugModeReportsNothing) {
   const DWORD checkPoint = nextCheckPoint;
   EXPECT_TRUE(ReportServiceStatus(SERVICE_START_PENDING, 0, 3000));
   EXPECT_EQ(nextCheckPoint, checkPoint);
+  debugMode = saved;
+}
+
+// The handler passes a device event on only under the lock whose holder ends
+// the notifications, and reads the state to report under the status lock.
+TEST(ServiceControlHandler, EventsAndReportsWaitForTheirLocks) {
+  InitializeProcessLocks();
+  const bool saved = debugMode;
+  debugMode = true;
+  EXPECT_TRUE(lockprobe::WaitsForTheSection(&deviceEventLock, [] {
+    ServiceControlHandler(SERVICE_CONTROL_DEVICEEVENT, DBT_DEVICEARRIVAL, nullptr, nullptr);
+  }));
+  // The state reported is read under the status lock: a change its holder
+  // makes meanwhile is the one reported.
+  debugMode = false;
+  serviceStatus.dwCurrentState = SERVICE_RUNNING;
+  EnterCriticalSection(&serviceStatusLock);
+  EXPECT_TRUE(lockprobe::WaitsForTheHeldLock(
+      [] { ServiceControlHandler(SERVICE_CONTROL_INTERROGATE, 0, nullptr, nullptr); },
+      [] {
+        serviceStatus.dwCurrentState = SERVICE_STOP_PENDING;
+        LeaveCriticalSection(&serviceStatusLock);
+      }));
+  EXPECT_EQ(serviceStatus.dwCurrentState, static_cast<DWORD>(SERVICE_STOP_PENDING));
   debugMode = saved;
 }
 

@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <utility>
 #include <vector>
 
 #include "platform/wide.h"
@@ -14,23 +15,28 @@ Verb Parse(std::vector<WideString> words) {
   return ParseVerb(static_cast<int>(words.size()), argv.data());
 }
 
-TEST(Verbs, PrefixedWordsInAnyCaseAreVerbs) {
-  EXPECT_EQ(Parse({WSTR("SkyvaneSvc"), WSTR("-install")}), Verb::Install);
-  EXPECT_EQ(Parse({WSTR("SkyvaneSvc"), WSTR("/INSTALL")}), Verb::Install);
-  EXPECT_EQ(Parse({WSTR("SkyvaneSvc"), WSTR("/Remove")}), Verb::Remove);
-  EXPECT_EQ(Parse({WSTR("SkyvaneSvc"), WSTR("-DeBuG"), WSTR("extra")}), Verb::Debug);
-}
-
-TEST(Verbs, AnythingElseFallsThroughToTheDispatcher) {
-  EXPECT_EQ(Parse({WSTR("SkyvaneSvc")}), Verb::None);
-  EXPECT_EQ(Parse({WSTR("SkyvaneSvc"), WSTR("install")}), Verb::None);
-  EXPECT_EQ(Parse({WSTR("SkyvaneSvc"), WSTR("-inst")}), Verb::None);
-  EXPECT_EQ(Parse({WSTR("SkyvaneSvc"), WSTR("--install")}), Verb::None);
-  EXPECT_EQ(Parse({WSTR("SkyvaneSvc"), WSTR("-installx")}), Verb::None);
-  EXPECT_EQ(Parse({WSTR("SkyvaneSvc"), WSTR("-")}), Verb::None);
-  EXPECT_EQ(Parse({WSTR("SkyvaneSvc"), WSTR("")}), Verb::None);
-  // Only the first argument counts.
-  EXPECT_EQ(Parse({WSTR("SkyvaneSvc"), WSTR("x"), WSTR("-install")}), Verb::None);
+// A verb is the first argument, "-" or "/" and the whole word in any case;
+// anything else falls through to the dispatcher.
+TEST(Verbs, OnlyAWholePrefixedFirstWordIsAVerb) {
+  const std::pair<std::vector<WideString>, Verb> cases[] = {
+      {{WSTR("-install")}, Verb::Install},
+      {{WSTR("/INSTALL")}, Verb::Install},
+      {{WSTR("/Remove")}, Verb::Remove},
+      {{WSTR("-DeBuG"), WSTR("extra")}, Verb::Debug},
+      {{}, Verb::None},
+      {{WSTR("install")}, Verb::None},
+      {{WSTR("-inst")}, Verb::None},
+      {{WSTR("--install")}, Verb::None},
+      {{WSTR("-installx")}, Verb::None},
+      {{WSTR("-")}, Verb::None},
+      {{WSTR("")}, Verb::None},
+      {{WSTR("x"), WSTR("-install")}, Verb::None},
+  };
+  for (const auto& [words, verb] : cases) {
+    std::vector<WideString> argv{WSTR("SkyvaneSvc")};
+    argv.insert(argv.end(), words.begin(), words.end());
+    EXPECT_EQ(Parse(argv), verb) << words.size();
+  }
 }
 
 }  // namespace
