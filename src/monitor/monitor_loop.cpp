@@ -146,7 +146,7 @@ PassKind RunPass() {
   MonitorState& m = monitorState;
   StateBlock* block = m.stateBlock;
   PublishStateBlock(nullptr, m.tick % 5 == 0);
-  WaitForSingleObject(m.stateMutex, INFINITE);
+  if (!TakeStateMutex(m.stateMutex)) return PassKind::Skipped;  // kept past a stop
   m.passCount += 1;
   if (m.paused != 0) {
     m.pauseTicks += 1;
@@ -204,7 +204,7 @@ PassKind RunPass() {
   StatusPass(block);
   ReleaseMutex(m.stateMutex);
   bool rescanDue = false;
-  WaitForSingleObject(m.stateMutex, INFINITE);
+  if (!TakeStateMutex(m.stateMutex)) return PassKind::Skipped;  // kept past a stop
   if (m.refreshRequests > 0) {
     m.refreshRequests = 0;
     block->statusWord = kStatusRescanStarting;
@@ -298,6 +298,7 @@ void TearDown(const MonitorSession* session, bool started) {
 
 void RunMonitor(int, LPWSTR*, const MonitorSession* session) {
   ResetMonitorState();
+  stateMutexKept = false;
   NullDaclSecurity security;
   bool started = false;
   if (StartUp(&security, session, &started)) {
@@ -315,8 +316,10 @@ void RunMonitor(int, LPWSTR*, const MonitorSession* session) {
       // One hold for both: a worker whose removal the stop cut short must
       // not put its 600 + n between the 500 and its publish.
       StateLock lock;
-      m.stateBlock->statusWord = kStatusStopping;
-      PublishStateBlock(nullptr, true);
+      if (lock.Owned()) {
+        m.stateBlock->statusWord = kStatusStopping;
+        PublishStateBlock(nullptr, true);
+      }
     }
   }
   TearDown(session, started);

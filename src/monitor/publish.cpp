@@ -83,7 +83,7 @@ HANDLE OpenStateMapping(SECURITY_ATTRIBUTES* attributes) {
 void PublishStateBlock(HANDLE mapping, bool force) {
   StateLock lock;
   StateBlock* block = monitorState.stateBlock;
-  if (block == nullptr || (monitorState.publishNeeded == 0 && !force)) return;
+  if (lock.Lost() || block == nullptr || (monitorState.publishNeeded == 0 && !force)) return;
   monitorState.publishNeeded = 0;
   const bool own = mapping == nullptr;
   void* view = own ? OwnView() : MapViewOfFile(mapping, FILE_MAP_WRITE, 0, 0, kStateBlockSize);

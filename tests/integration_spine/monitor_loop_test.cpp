@@ -3,6 +3,7 @@
 // monitor thread between passes, so the sequence of passes is deterministic.
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <cstdio>
@@ -291,6 +292,31 @@ TEST_F(MonitorLoop, RefreshIsPublishedAs101ThenAs102) {
   EXPECT_EQ(after[1], 102u);
   EXPECT_EQ(after.back(), 500u);
   EXPECT_EQ(observer_.passes[2].rescans, observer_.passes[1].rescans + 1);
+}
+
+TEST_F(MonitorLoop, AProgramThatKeepsTheMutexCannotKeepTheStopFromEnding) {
+  // Any account may open the named mutex and keep it; the service's threads
+  // (monitor, workers) then wait for it until the stop bounds their waits.
+  std::atomic<bool> taken{false};
+  std::atomic<bool> release{false};
+  std::thread holder;
+  Run([&](const std::vector<Pass>& passes) {
+    if (passes.size() != 2) return;
+    holder = std::thread([&] {
+      const HANDLE mutex = OpenMutexW(SYNCHRONIZE | MUTEX_MODIFY_STATE, FALSE, kStateMutexName);
+      WaitForSingleObject(mutex, INFINITE);
+      taken = true;
+      while (!release) Sleep(1);
+      ReleaseMutex(mutex);
+      CloseHandle(mutex);
+    });
+    while (!taken) Sleep(1);
+    StopMonitor();
+  });
+  release = true;
+  holder.join();
+  EXPECT_NE(observer_.publishedStatus.back(), 500u) << "the block was written without the mutex";
+  EXPECT_EQ(monitorState.stateMutex, nullptr);
 }
 
 TEST_F(MonitorLoop, TickWrapsFrom3000To1) {
