@@ -46,14 +46,17 @@ int Probe(long limitMs) {
   auto start = std::chrono::steady_clock::now();
   HANDLE pipe = OpenCommandPipe(5000);
   if (pipe == INVALID_HANDLE_VALUE) {
-    std::fprintf(stderr, "probe: cannot open the pipe: %lu\n", static_cast<unsigned long>(GetLastError()));
+    std::fprintf(stderr, "probe: cannot open the pipe: %lu\n",
+                 static_cast<unsigned long>(GetLastError()));
     return 1;
   }
   bool ok = ExchangeOnce(pipe, request.get(), reply.get());
-  auto elapsed = std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - start);
+  auto elapsed =
+      std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - start);
   CloseHandle(pipe);
   if (!ok) {
-    std::fprintf(stderr, "probe: exchange failed: %lu\n", static_cast<unsigned long>(GetLastError()));
+    std::fprintf(stderr, "probe: exchange failed: %lu\n",
+                 static_cast<unsigned long>(GetLastError()));
     return 1;
   }
   std::printf("%.3f\n", elapsed.count());

@@ -27,9 +27,9 @@
 #include "monitor/monitor_state.h"
 #include "pipe/pipe_client.h"
 #include "platform/diagnostics.h"
-#include "transport/io_block.h"
 #include "service/process_locks.h"
 #include "service/service_host.h"
+#include "transport/io_block.h"
 
 namespace {
 

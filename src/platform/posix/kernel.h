@@ -34,7 +34,7 @@ constexpr std::uint32_t kMaxHolders = 16;
 constexpr std::uint32_t kPipeInstanceCount = 64;
 constexpr std::uint32_t kPipeQueueBytes = 64 * 1024;
 constexpr std::uint32_t kWaiterCount = 4096;  // threads asleep at once, all processes
-constexpr std::uint32_t kMaxWaitKeys = 72;  // 64 objects, or a process's pipe instances
+constexpr std::uint32_t kMaxWaitKeys = 72;    // 64 objects, or a process's pipe instances
 constexpr std::uint32_t kJournalEntries = 32768;
 constexpr std::uint32_t kJournalBytes = 4 * 1024 * 1024;
 

@@ -172,9 +172,9 @@ LPVOID MapViewOfFile(HANDLE mapping, DWORD desiredAccess, DWORD fileOffsetHigh, 
   std::size_t length =
       numberOfBytesToMap == 0 ? static_cast<std::size_t>(size - offset) : numberOfBytesToMap;
   int protection = write || copy ? PROT_READ | PROT_WRITE : PROT_READ;
-  void* view = mmap(nullptr, length, protection, copy ? MAP_PRIVATE : MAP_SHARED,
-                    emu::kernel::RegionFd(),
-                    static_cast<off_t>(emu::kernel::kArenaOffset + slot->arenaOffset + offset));
+  void* view =
+      mmap(nullptr, length, protection, copy ? MAP_PRIVATE : MAP_SHARED, emu::kernel::RegionFd(),
+           static_cast<off_t>(emu::kernel::kArenaOffset + slot->arenaOffset + offset));
   if (view == MAP_FAILED) {
     SetLastError(ERROR_NOT_ENOUGH_MEMORY);
     return nullptr;

@@ -6,9 +6,9 @@
 #include <unistd.h>
 
 #include <climits>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <cstdio>
 #include <mutex>
 #include <string>
 #include <vector>

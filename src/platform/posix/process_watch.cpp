@@ -137,8 +137,8 @@ bool ProcessAlive(const ProcessId& process) {
   // The pid may belong to a later process by now.
   char state = 0;
   std::uint64_t startTime = 0;
-  bool same = ReadProcessStart(process.pid, &state, &startTime) && state != 'Z' &&
-              state != 'X' && (process.startTime == 0 || startTime == process.startTime);
+  bool same = ReadProcessStart(process.pid, &state, &startTime) && state != 'Z' && state != 'X' &&
+              (process.startTime == 0 || startTime == process.startTime);
   if (!same || Readable(pidfd)) {
     close(pidfd);
     return false;

@@ -356,8 +356,10 @@ struct SID {
 };
 constexpr BYTE SID_REVISION = 1;
 constexpr BYTE SID_MAX_SUB_AUTHORITIES = 15;
-#define SECURITY_WORLD_SID_AUTHORITY {0, 0, 0, 0, 0, 1}
-#define SECURITY_NT_AUTHORITY {0, 0, 0, 0, 0, 5}
+#define SECURITY_WORLD_SID_AUTHORITY \
+  { 0, 0, 0, 0, 0, 1 }
+#define SECURITY_NT_AUTHORITY \
+  { 0, 0, 0, 0, 0, 5 }
 constexpr DWORD SECURITY_WORLD_RID = 0;
 constexpr DWORD SECURITY_NETWORK_RID = 2;
 constexpr DWORD ACL_REVISION = 2;
