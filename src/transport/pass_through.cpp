@@ -126,7 +126,8 @@ DWORD SendScsi(HANDLE device, const ScsiBlock& block, BYTE* data, DWORD dataLeng
   if (done) {
     SetLastError(ERROR_SUCCESS);
     result = CommandOutcome(block.request, dataLength);
-    if (result == ERROR_SUCCESS && block.request->spt.DataIn == SCSI_IOCTL_DATA_IN) {
+    if (result == ERROR_SUCCESS && data != nullptr &&
+        block.request->spt.DataIn == SCSI_IOCTL_DATA_IN) {
       std::memcpy(data, block.data, dataLength);
     }
   } else {
