@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "pipe/pipe_client.h"
 #include "platform/win32.h"
 
 namespace sim {
@@ -43,28 +44,21 @@ inline std::vector<std::string> SplitRequest(const std::string& message) {
 // Win32 error) when no machine serves the channel or the exchange fails.
 inline bool ControlExchange(const std::vector<std::string>& words, std::string* reply,
                             DWORD* error) {
-  HANDLE pipe = CreateFileW(kControlPipeName, GENERIC_READ | GENERIC_WRITE, 0, nullptr,
-                            OPEN_EXISTING, 0, nullptr);
-  if (pipe == INVALID_HANDLE_VALUE && GetLastError() == ERROR_PIPE_BUSY &&
-      WaitNamedPipeW(kControlPipeName, 5000)) {
-    pipe = CreateFileW(kControlPipeName, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0,
-                       nullptr);
+  const std::string request = JoinRequest(words);
+  if (request.size() > kControlMessageMax) {
+    *error = ERROR_INVALID_DATA;
+    return false;
   }
+  const HANDLE pipe = OpenMessagePipe(kControlPipeName, 5000);
   if (pipe == INVALID_HANDLE_VALUE) {
     *error = GetLastError();
     return false;
   }
-  DWORD mode = PIPE_READMODE_MESSAGE;
-  const std::string request = JoinRequest(words);
   std::vector<char> buffer(kControlMessageMax);
-  DWORD written = 0;
   DWORD received = 0;
-  const bool ok =
-      SetNamedPipeHandleState(pipe, &mode, nullptr, nullptr) &&
-      request.size() <= kControlMessageMax &&
-      WriteFile(pipe, request.data(), static_cast<DWORD>(request.size()), &written, nullptr) &&
-      ReadFile(pipe, buffer.data(), kControlMessageMax, &received, nullptr);
-  *error = ok ? 0 : (request.size() > kControlMessageMax ? ERROR_INVALID_DATA : GetLastError());
+  const bool ok = ExchangeCommand(pipe, request.data(), static_cast<DWORD>(request.size()),
+                                  buffer.data(), kControlMessageMax, &received);
+  *error = ok ? 0 : GetLastError();
   CloseHandle(pipe);
   if (ok) reply->assign(buffer.data(), received);
   return ok;

@@ -3,10 +3,11 @@
 // Used by the command-line client and the tests; the service does not call it.
 // Header-only, so that a client needs nothing but the platform layer.
 //
-// OpenCommandPipe(busyWaitMs): opens "\\.\pipe\QxSvcPipe" for reading and
-//   writing in message mode, letting the server identify the caller but not
+// OpenMessagePipe(name, busyWaitMs): opens the pipe for reading and writing
+//   in message mode, letting the server identify the caller but not
 //   impersonate it; while every instance is busy it waits up to busyWaitMs
 //   for one to free up. INVALID_HANDLE_VALUE (last error set) on failure.
+// OpenCommandPipe(busyWaitMs): the same for "\\.\pipe\QxSvcPipe".
 // ExchangeCommand: writes `length` bytes of `request` as one message and reads
 //   the reply message into reply[capacity]. False (last error set) when either
 //   fails; an empty reply is a success with *replyLength 0.
@@ -32,9 +33,9 @@
 // SECURITY_IDENTIFICATION, as the system headers define them).
 inline constexpr DWORD kPipeClientSecurityFlags = 0x00100000 | 0x00010000;
 
-inline HANDLE OpenCommandPipe(DWORD busyWaitMs) {
+inline HANDLE OpenMessagePipe(const WCHAR* name, DWORD busyWaitMs) {
   for (int attempt = 0; attempt < 2; ++attempt) {
-    HANDLE pipe = CreateFileW(kPipeName, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING,
+    HANDLE pipe = CreateFileW(name, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING,
                               kPipeClientSecurityFlags, nullptr);
     if (pipe != INVALID_HANDLE_VALUE) {
       DWORD mode = PIPE_READMODE_MESSAGE;
@@ -47,9 +48,13 @@ inline HANDLE OpenCommandPipe(DWORD busyWaitMs) {
       return pipe;
     }
     if (GetLastError() != ERROR_PIPE_BUSY || attempt == 1) break;
-    if (!WaitNamedPipeW(kPipeName, busyWaitMs)) break;
+    if (!WaitNamedPipeW(name, busyWaitMs)) break;
   }
   return INVALID_HANDLE_VALUE;
+}
+
+inline HANDLE OpenCommandPipe(DWORD busyWaitMs) {
+  return OpenMessagePipe(kPipeName, busyWaitMs);
 }
 
 inline bool ExchangeCommand(HANDLE pipe, const void* request, DWORD length, void* reply,

@@ -67,12 +67,11 @@ OpenedDrive OpenDrive(const DriveRecord* drive) {
     NoteRefreshConditions(drive, kRefreshNoStatusPath, true);
     return opened;
   }
-  // Both paths use an overlapped handle, so that a wait for a device that
-  // does not answer can be given up.
-  const DWORD flags = FILE_FLAG_OVERLAPPED;
+  // Overlapped on both paths, so that a wait for a device that does not
+  // answer can be given up.
   opened.handle =
       CreateFileW(path, GENERIC_READ | GENERIC_WRITE, FILE_SHARE_READ | FILE_SHARE_WRITE, nullptr,
-                  OPEN_EXISTING, flags, nullptr);
+                  OPEN_EXISTING, FILE_FLAG_OVERLAPPED, nullptr);
   if (opened.handle == INVALID_HANDLE_VALUE) {
     opened.error = FailureCode(GetLastError());
     NoteRefreshConditions(drive, kRefreshOpenFails, true);

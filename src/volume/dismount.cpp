@@ -13,8 +13,7 @@ constexpr DWORD kErrorNoMediaInDrive = 1112;  // ERROR_NO_MEDIA_IN_DRIVE
 // the volume does not answer within the device time-out or the service stops:
 // the callers hold the state mutex.
 bool PlainControl(HANDLE volume, DWORD code) {
-  DWORD bytes = 0;
-  return IoControlWait(volume, code, nullptr, 0, nullptr, 0, &bytes, monitorState.stopEvent);
+  return IoControlWait(volume, code, nullptr, 0, nullptr, 0, nullptr, monitorState.stopEvent);
 }
 
 }  // namespace
