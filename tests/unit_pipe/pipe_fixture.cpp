@@ -79,19 +79,9 @@ Handle ServerFixture::Connect() {
   }
 }
 
-DWORD Exchange::Result() const {
+DWORD Exchange::Field(std::size_t offset) const {
   DWORD value = 0;
-  if (reply.size() >= offsetof(CommandMessage, result) + sizeof(DWORD)) {
-    std::memcpy(&value, reply.data() + offsetof(CommandMessage, result), sizeof(value));
-  }
-  return value;
-}
-
-DWORD Exchange::Detail() const {
-  DWORD value = 0;
-  if (reply.size() >= offsetof(CommandMessage, detail) + sizeof(DWORD)) {
-    std::memcpy(&value, reply.data() + offsetof(CommandMessage, detail), sizeof(value));
-  }
+  if (reply.size() >= offset + sizeof(DWORD)) std::memcpy(&value, reply.data() + offset, 4);
   return value;
 }
 

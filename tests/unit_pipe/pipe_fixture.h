@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <vector>
@@ -54,8 +55,9 @@ struct Exchange {
   bool ok = false;
   DWORD error = 0;
   std::vector<BYTE> reply;
-  DWORD Result() const;
-  DWORD Detail() const;
+  DWORD Result() const { return Field(offsetof(CommandMessage, result)); }
+  DWORD Detail() const { return Field(offsetof(CommandMessage, detail)); }
+  DWORD Field(std::size_t offset) const;
 };
 Exchange Send(HANDLE client, const void* request, DWORD sent);
 Exchange Send(HANDLE client, const CommandMessage& message);

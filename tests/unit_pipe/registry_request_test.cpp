@@ -21,15 +21,14 @@ namespace {
 using pipetest::NewCommand;
 
 // A key of this case's own below HKEY_CURRENT_USER\Software, removed at the end.
-class RegistryRequestTest : public ::testing::Test {
+class RegistryRequestTest : public pipetest::MonitorFixture {
  protected:
   // A full-length command 13 message for this case's key.
   std::unique_ptr<CommandMessage> Request(const char* name, DWORD operation, DWORD type,
                                           const void* data, DWORD dataLength) {
     auto message = NewCommand(kCommandRegistry);
-    const WideString wideName = Utf8ToWide(name);
     EXPECT_TRUE(LayOutRegistryRequest(message.get(), RootKeyValue(HKEY_CURRENT_USER), path_.c_str(),
-                                      wideName.c_str(), operation, type, data, dataLength));
+                                      Utf8ToWide(name).c_str(), operation, type, data, dataLength));
     return message;
   }
 
@@ -40,31 +39,21 @@ class RegistryRequestTest : public ::testing::Test {
     return RunRegistryRequest(reinterpret_cast<BYTE*>(&message->registry), available);
   }
 
-  // The value's data as the registry holds it, or nothing when it is absent.
-  bool ReadValue(const char* name, DWORD* type, std::vector<BYTE>* data) {
+  // The value's type and data as the registry holds them; type 0xFFFF when absent.
+  std::vector<BYTE> ReadValue(const char* name, DWORD* type) {
+    std::vector<BYTE> data(2048);
+    DWORD size = static_cast<DWORD>(data.size());
+    *type = 0xFFFF;
     HKEY key = nullptr;
-    if (RegOpenKeyExW(HKEY_CURRENT_USER, path_.c_str(), 0, KEY_READ, &key) != ERROR_SUCCESS) {
-      return false;
+    if (RegOpenKeyExW(HKEY_CURRENT_USER, path_.c_str(), 0, KEY_READ, &key) == ERROR_SUCCESS) {
+      if (RegQueryValueExW(key, Utf8ToWide(name).c_str(), nullptr, type, data.data(), &size) !=
+          ERROR_SUCCESS) {
+        size = 0;
+      }
+      RegCloseKey(key);
     }
-    data->assign(2048, 0);
-    DWORD size = static_cast<DWORD>(data->size());
-    const WideString wideName = Utf8ToWide(name);
-    const LSTATUS status =
-        RegQueryValueExW(key, wideName.c_str(), nullptr, type, data->data(), &size);
-    RegCloseKey(key);
-    data->resize(size);
-    return status == ERROR_SUCCESS;
-  }
-
-  void WriteValue(const char* name, DWORD type, const std::vector<BYTE>& data) {
-    HKEY key = nullptr;
-    ASSERT_EQ(RegOpenKeyExW(HKEY_CURRENT_USER, path_.c_str(), 0, KEY_ALL_ACCESS, &key),
-              ERROR_SUCCESS);
-    const WideString wideName = Utf8ToWide(name);
-    EXPECT_EQ(RegSetValueExW(key, wideName.c_str(), 0, type, data.data(),
-                             static_cast<DWORD>(data.size())),
-              ERROR_SUCCESS);
-    RegCloseKey(key);
+    data.resize(size);
+    return data;
   }
 
   pipetest::TestKey key_;
@@ -78,15 +67,11 @@ std::vector<BYTE> Pattern(std::size_t size) {
 }
 
 TEST_F(RegistryRequestTest, OutcomesOfSetQueryAndOtherOperations) {
-  const std::vector<BYTE> data = Pattern(100);
-  auto set = Request("Blob", kRegistrySet, REG_BINARY, data.data(), 100);
-  EXPECT_EQ(Run(set.get()), ERROR_SUCCESS);
-
+  const std::vector<BYTE> data = Pattern(300);
+  EXPECT_EQ(Run(Request("Blob", kRegistrySet, REG_BINARY, data.data(), 100).get()), ERROR_SUCCESS);
   DWORD type = 0;
-  std::vector<BYTE> stored;
-  ASSERT_TRUE(ReadValue("Blob", &type, &stored));
+  EXPECT_EQ(ReadValue("Blob", &type), std::vector<BYTE>(data.begin(), data.begin() + 100));
   EXPECT_EQ(type, static_cast<DWORD>(REG_BINARY));
-  EXPECT_EQ(stored, data);
 
   auto query = Request("Blob", kRegistryQuery, REG_NONE, nullptr, 400);
   query->registry.dataLengthHigh = 0xDEADBEEF;
@@ -97,24 +82,17 @@ TEST_F(RegistryRequestTest, OutcomesOfSetQueryAndOtherOperations) {
   EXPECT_EQ(std::memcmp(RegistryData(query.get()), data.data(), 100), 0);
 
   // A small area gives more-data and the size needed.
-  WriteValue("Big", REG_BINARY, Pattern(300));
+  EXPECT_EQ(Run(Request("Big", kRegistrySet, REG_BINARY, data.data(), 300).get()), ERROR_SUCCESS);
   auto small = Request("Big", kRegistryQuery, REG_NONE, nullptr, 10);
   EXPECT_EQ(Run(small.get()), static_cast<DWORD>(ERROR_MORE_DATA));
   EXPECT_EQ(small->registry.dataLength, 300u);
 
   auto absent = Request("Absent", kRegistryQuery, REG_NONE, nullptr, 64);
   EXPECT_EQ(Run(absent.get()), static_cast<DWORD>(ERROR_FILE_NOT_FOUND));
-
-  auto missingKey = NewCommand(kCommandRegistry);
-  const WideString path = path_ + Utf8ToWide("\\NoSuchKey");
-  ASSERT_TRUE(LayOutRegistryRequest(missingKey.get(), RootKeyValue(HKEY_CURRENT_USER), path.c_str(),
-                                    WSTR("x"), kRegistryQuery, REG_NONE, nullptr, 64));
-  EXPECT_EQ(Run(missingKey.get()), static_cast<DWORD>(ERROR_FILE_NOT_FOUND));
-  EXPECT_EQ(missingKey->registry.dataLength, 64u);  // the request's own length stays
+  EXPECT_EQ(absent->registry.dataLength, 64u) << "the request's own length stays";
 
   // Any other operation only opens the key.
-  auto request = Request("Untouched", 2, REG_BINARY, data.data(), 8);
-  EXPECT_EQ(Run(request.get()), ERROR_SUCCESS);
+  EXPECT_EQ(Run(Request("Untouched", 2, REG_BINARY, data.data(), 8).get()), ERROR_SUCCESS);
   EXPECT_FALSE(key_.HasValue(WSTR("Untouched")));
 }
 
@@ -137,7 +115,6 @@ TEST_F(RegistryRequestTest, RootKeyMustBePredefined) {
   for (std::uint64_t root : refused) {
     auto request = Request("Refused", kRegistrySet, REG_BINARY, data.data(), 4);
     request->registry.rootKey = root;
-    // The relative path as if the root were HKEY_CURRENT_USER\Software.
     EXPECT_EQ(Run(request.get()), static_cast<DWORD>(ERROR_INVALID_PARAMETER)) << std::hex << root;
   }
   RegCloseKey(own);
@@ -154,11 +131,10 @@ TEST_F(RegistryRequestTest, RootKeyMustBePredefined) {
       EXPECT_EQ(Run(request.get()), ERROR_SUCCESS) << std::hex << value;
     }
   }
-  // The 32-bit form reaches the same key as the 64-bit one.
   auto set = Request("Narrow", kRegistrySet, REG_BINARY, data.data(), 4);
   set->registry.rootKey = RootKeyValue(HKEY_CURRENT_USER) & 0xFFFFFFFFu;
   EXPECT_EQ(Run(set.get()), ERROR_SUCCESS);
-  EXPECT_TRUE(key_.HasValue(WSTR("Narrow")));
+  EXPECT_TRUE(key_.HasValue(WSTR("Narrow"))) << "the 32-bit form reached another key";
 }
 
 // Offsets and lengths against the bytes delivered: each case is laid out in a
@@ -208,46 +184,31 @@ TEST_F(RegistryRequestTest, TextsAndDataMustLieInsideTheBytesDelivered) {
   EXPECT_FALSE(key_.HasValue(WSTR("Edge")));
 
   // Exactly enough bytes: the data area ends on the last byte delivered.
-  auto exact = std::make_unique<CommandMessage>(*base);
-  EXPECT_EQ(Run(exact.get(), dataEnd), ERROR_SUCCESS);
+  EXPECT_EQ(Run(base.get(), dataEnd), ERROR_SUCCESS);
   DWORD type = 0;
-  std::vector<BYTE> stored;
-  ASSERT_TRUE(ReadValue("Edge", &type, &stored));
-  EXPECT_EQ(stored, data);
-}
+  EXPECT_EQ(ReadValue("Edge", &type), data);
 
-TEST_F(RegistryRequestTest, DataAreaMayEndOnTheLastByteOfTheMessage) {
-  // Path and name at the start, data area reaching the very end of the message.
-  auto request = Request("Tail", kRegistrySet, REG_BINARY, nullptr, 0);
-  const std::size_t room = sizeof(request->registryText);
-  const std::size_t used =
-      static_cast<std::size_t>(request->registry.nameOffset + request->registry.dataOffset);
-  const std::size_t tail = room - used;
-  std::memset(RegistryData(request.get()), 0x5A, tail);
-  request->registry.dataLength = static_cast<DWORD>(tail);
-  EXPECT_EQ(Run(request.get()), ERROR_SUCCESS);
-  DWORD type = 0;
-  std::vector<BYTE> stored;
-  ASSERT_TRUE(ReadValue("Tail", &type, &stored));
-  EXPECT_EQ(stored, std::vector<BYTE>(tail, 0x5A));
+  // A data area that ends on the very last byte of the message.
+  auto tail = Request("Tail", kRegistrySet, REG_BINARY, nullptr, 0);
+  const std::size_t room =
+      sizeof(tail->registryText) -
+      static_cast<std::size_t>(tail->registry.nameOffset + tail->registry.dataOffset);
+  std::memset(RegistryData(tail.get()), 0x5A, room);
+  tail->registry.dataLength = static_cast<DWORD>(room);
+  EXPECT_EQ(Run(tail.get()), ERROR_SUCCESS);
+  EXPECT_EQ(ReadValue("Tail", &type), std::vector<BYTE>(room, 0x5A));
 }
 
 // Through the dispatcher: what counts is what the client delivered and
 // declared, whichever is less.
-class RegistryDispatchTest : public pipetest::MonitorFixture {};
+using RegistryDispatchTest = RegistryRequestTest;
 
 TEST_F(RegistryDispatchTest, BytesNotDeliveredOrBeyondTheDeclaredLengthAreRefused) {
-  const pipetest::TestKey testKey;
-  const WideString& path = testKey.path;
-
   const DWORD data = 0x01020304;
-  auto message = NewCommand(kCommandRegistry);
-  ASSERT_TRUE(LayOutRegistryRequest(message.get(), RootKeyValue(HKEY_CURRENT_USER), path.c_str(),
-                                    WSTR("Cut"), kRegistrySet, REG_DWORD, &data, sizeof(data)));
+  auto message = Request("Cut", kRegistrySet, REG_DWORD, &data, sizeof(data));
   const std::size_t dataEnd = static_cast<std::size_t>(RegistryData(message.get()) -
                                                        reinterpret_cast<BYTE*>(message.get())) +
                               sizeof(data);
-
   std::vector<BYTE> request(kPipeBufferBytes);
   std::vector<BYTE> reply(kPipeBufferBytes);
   auto dispatch = [&](DWORD received, std::uint64_t declared) {
@@ -264,24 +225,18 @@ TEST_F(RegistryDispatchTest, BytesNotDeliveredOrBeyondTheDeclaredLengthAreRefuse
   // The data's last byte did not arrive, although the message declares it.
   EXPECT_EQ(dispatch(static_cast<DWORD>(dataEnd - 1), kCommandMaxLength),
             static_cast<DWORD>(ERROR_INVALID_PARAMETER));
-  EXPECT_FALSE(testKey.HasValue(WSTR("Cut")));
+  EXPECT_FALSE(key_.HasValue(WSTR("Cut")));
   // It arrived, though beyond the length the message declares: what arrived
   // bounds the request.
   if (dataEnd > kCommandMinLength) {
     EXPECT_EQ(dispatch(kCommandMaxLength, dataEnd - 1), ERROR_SUCCESS);
-    EXPECT_TRUE(testKey.HasValue(WSTR("Cut")));
+    EXPECT_TRUE(key_.HasValue(WSTR("Cut")));
   }
-  // Delivered and declared: stored.
   EXPECT_EQ(dispatch(static_cast<DWORD>(dataEnd), kCommandMaxLength), ERROR_SUCCESS);
-  HKEY check = nullptr;
-  ASSERT_EQ(RegOpenKeyExW(HKEY_CURRENT_USER, path.c_str(), 0, KEY_READ, &check), ERROR_SUCCESS);
-  DWORD stored = 0;
-  DWORD size = sizeof(stored);
-  EXPECT_EQ(RegQueryValueExW(check, WSTR("Cut"), nullptr, nullptr, reinterpret_cast<BYTE*>(&stored),
-                             &size),
-            ERROR_SUCCESS);
-  EXPECT_EQ(stored, data);
-  RegCloseKey(check);
+  DWORD type = 0;
+  const std::vector<BYTE> stored = ReadValue("Cut", &type);
+  ASSERT_EQ(stored.size(), sizeof(data));
+  EXPECT_EQ(std::memcmp(stored.data(), &data, sizeof(data)), 0);
 }
 
 }  // namespace
