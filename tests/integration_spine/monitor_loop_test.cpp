@@ -219,79 +219,66 @@ TEST_F(MonitorLoop, PauseFreezesTheTickAndEndsAfterSixtyPassesWithARescan) {
   EXPECT_EQ(monitorState.paused, 0u);
 }
 
-TEST_F(MonitorLoop, SkipTicksIdlesTenPasses) {
-  Run([](const std::vector<Pass>& passes) {
-    if (passes.size() == 1) Set(&MonitorState::skipTicks, 10);
-    if (passes.size() == 14) StopMonitor();
-  });
-  const std::vector<Pass>& passes = observer_.passes;
-  ASSERT_EQ(passes.size(), 14u);
-  for (std::size_t i = 1; i <= 10; ++i) {
-    EXPECT_EQ(passes[i].kind, PassKind::Skipped) << i;
-    EXPECT_EQ(passes[i].tick, passes[0].tick) << i;
-  }
-  EXPECT_EQ(passes[11].kind, PassKind::Regular);
-  EXPECT_EQ(passes[11].tick, passes[0].tick + 1);
-}
-
-TEST_F(MonitorLoop, DeviceChangeAndStaleListBecomeOneImmediateRefresh) {
-  Run([](const std::vector<Pass>& passes) {
-    if (passes.size() == 1) {
-      StateLock lock;
-      monitorState.deviceChangePending = 1;
-      monitorState.driveListStale = 1;
-    }
-    if (passes.size() == 4) StopMonitor();
-  });
-  const std::vector<Pass>& passes = observer_.passes;
-  ASSERT_EQ(passes.size(), 4u);
-  // The flags are turned into a refresh on a pass of their own, which does
-  // not sleep and does not advance the tick.
-  EXPECT_EQ(passes[1].kind, PassKind::DeviceChange);
-  EXPECT_EQ(passes[1].tick, passes[0].tick);
-  // One refresh: the next regular tick runs exactly one rescan.
-  EXPECT_EQ(passes[2].kind, PassKind::Regular);
-  EXPECT_EQ(passes[2].rescans, passes[0].rescans + 1);
-  EXPECT_EQ(passes[3].rescans, passes[2].rescans);
-}
-
-TEST_F(MonitorLoop, RestartAndRemovalRequestsTakePassesOfTheirOwn) {
-  Run([](const std::vector<Pass>& passes) {
-    if (passes.size() == 1) Set(&MonitorState::workersRestartRequested, 1);
-    if (passes.size() == 2) Set(&MonitorState::removalCheckRequested, 1);
-    if (passes.size() == 5) StopMonitor();
-  });
-  const std::vector<Pass>& passes = observer_.passes;
-  ASSERT_EQ(passes.size(), 5u);
-  EXPECT_EQ(passes[1].kind, PassKind::WorkersRestart);
-  EXPECT_EQ(passes[2].kind, PassKind::RemovalCheck);
-  EXPECT_EQ(passes[1].tick, passes[0].tick);
-  EXPECT_EQ(passes[2].tick, passes[0].tick);
-  // The removal check is followed by a refresh: one rescan on the next tick.
-  EXPECT_EQ(passes[3].kind, PassKind::Regular);
-  EXPECT_EQ(passes[3].rescans, passes[0].rescans + 1);
-  EXPECT_EQ(passes[4].rescans, passes[3].rescans);
-}
-
-TEST_F(MonitorLoop, RefreshIsPublishedAs101ThenAs102) {
+// One run through the requests that take passes of their own, each made
+// after the previous one settled: ten skipped ticks, a device change with a
+// stale list, a worker restart then a removal check, the tick's wrap from 3000
+// to 1, and a refresh.
+TEST_F(MonitorLoop, RequestsTakePassesOfTheirOwnAndTheTickWraps) {
   std::size_t publishesBefore = 0;
   Run([this, &publishesBefore](const std::vector<Pass>& passes) {
-    if (passes.size() == 2) {
-      {
+    switch (passes.size()) {
+      case 1:
+        Set(&MonitorState::skipTicks, 10);
+        break;
+      case 12: {
+        StateLock lock;
+        monitorState.deviceChangePending = 1;
+        monitorState.driveListStale = 1;
+        break;
+      }
+      case 15:
+        Set(&MonitorState::workersRestartRequested, 1);
+        break;
+      case 16:
+        Set(&MonitorState::removalCheckRequested, 1);
+        break;
+      case 19:
+        Set(&MonitorState::tick, 2999);
+        break;
+      case 22: {
         std::lock_guard<std::mutex> guard(observer_.lock);
         publishesBefore = observer_.publishedStatus.size();
       }
-      RequestRefresh();
+        RequestRefresh();
+        break;
+      case 24:
+        StopMonitor();
+        break;
     }
-    if (passes.size() == 4) StopMonitor();
   });
+  const std::vector<Pass>& passes = observer_.passes;
+  ASSERT_EQ(passes.size(), 24u);
+  // S skipped, D device change, W workers restart, C removal check. The flags
+  // become a refresh on a pass that does not sleep or advance the tick; one
+  // refresh is one rescan on the next regular tick.
+  const std::string kinds = "RSSSSSSSSSSRDRRWCRRRRRRR";
+  const DWORD ticks[] = {0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1, 1, 2, 3, 3, 3, 4, 5};
+  const DWORD wrapped[] = {3000, 1, 2, 3, 4};
+  const DWORD rescans[] = {0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1, 1, 1, 1, 2, 2, 2, 2, 2, 3, 3};
+  const std::string kindLetters = "PSDWCR";  // in PassKind's order
+  for (std::size_t i = 0; i < passes.size(); ++i) {
+    SCOPED_TRACE(i);
+    EXPECT_EQ(kinds[i], kindLetters[static_cast<std::size_t>(passes[i].kind)]);
+    EXPECT_EQ(passes[i].tick, i < 19 ? passes[0].tick + ticks[i] : wrapped[i - 19]);
+    EXPECT_EQ(passes[i].rescans, passes[0].rescans + rescans[i]);
+  }
+  // The refresh is published as 101, then 102 when its rescan ends.
   std::vector<DWORD> after(observer_.publishedStatus.begin() + static_cast<long>(publishesBefore),
                            observer_.publishedStatus.end());
   ASSERT_GE(after.size(), 3u);
   EXPECT_EQ(after[0], 101u);
   EXPECT_EQ(after[1], 102u);
   EXPECT_EQ(after.back(), 500u);
-  EXPECT_EQ(observer_.passes[2].rescans, observer_.passes[1].rescans + 1);
 }
 
 TEST_F(MonitorLoop, AProgramThatKeepsTheMutexCannotKeepTheStopFromEnding) {
@@ -317,18 +304,6 @@ TEST_F(MonitorLoop, AProgramThatKeepsTheMutexCannotKeepTheStopFromEnding) {
   holder.join();
   EXPECT_NE(observer_.publishedStatus.back(), 500u) << "the block was written without the mutex";
   EXPECT_EQ(monitorState.stateMutex, nullptr);
-}
-
-TEST_F(MonitorLoop, TickWrapsFrom3000To1) {
-  Run([](const std::vector<Pass>& passes) {
-    if (passes.size() == 1) Set(&MonitorState::tick, 2999);
-    if (passes.size() == 4) StopMonitor();
-  });
-  const std::vector<Pass>& passes = observer_.passes;
-  ASSERT_EQ(passes.size(), 4u);
-  EXPECT_EQ(passes[1].tick, 3000u);
-  EXPECT_EQ(passes[2].tick, 1u);
-  EXPECT_EQ(passes[3].tick, 2u);
 }
 
 TEST_F(MonitorLoop, ExistingSharedObjectsAreUsedAndOutliveTheService) {
@@ -450,7 +425,7 @@ TEST_F(MonitorLoop, StopDuringAForwardedResumeWithAHungWorkerEndsWith500) {
   EXPECT_EQ(observer_.publishedStatus.back(), 500u) << "a command published after the stop";
 }
 
-TEST_F(MonitorLoop, WorkerRestartWaitsForAQuiesceOnAnotherThread) {
+TEST_F(MonitorLoop, WorkerRestartWaitsForAQuiesceAndARescanStopsRunningWorkers) {
   InstallDefaultMachine();
   Start([](const std::vector<Pass>&) {});
   ASSERT_TRUE(WaitUntil([this] {
@@ -482,25 +457,11 @@ TEST_F(MonitorLoop, WorkerRestartWaitsForAQuiesceOnAnotherThread) {
     }
     EXPECT_EQ(workerState.workerHandleCount, workerState.workerCount);
   }
-  StopMonitor();
-  Finish();
-  // Handles and threads of every worker are gone: checked by the leak check.
-}
-
-TEST_F(MonitorLoop, RescanWhileWorkersRunStopsThemFirst) {
-  // A forwarded resume may start workers before the start-up rescan runs.
-  InstallDefaultMachine();
-  Start([](const std::vector<Pass>&) {});
-  // A first pass means the state was set up (and the start-up rescan ran).
-  ASSERT_TRUE(WaitUntil([this] { return PassCount() >= 1; }));
-  ASSERT_TRUE(WaitUntil([] {
-    StateLock lock;
-    return monitorState.rescanCount >= 1 && workerState.workerCount > 0;
-  }));
+  // A rescan while workers run (a forwarded resume may start them before the
+  // start-up rescan) stops them first: the leak check finds their handles.
   RescanDrives();
   StopMonitor();
   Finish();
-  // Every channel handle of the first workers was closed: the leak check.
 }
 
 TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
