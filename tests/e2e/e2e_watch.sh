@@ -5,39 +5,18 @@
 set -u
 SVC=$1
 CLIENT=$2
-WORK=$(mktemp -d)
-export SKYVANE_NAMESPACE="e2e-watch-$$"
-export SKYVANE_REGISTRY="$WORK/registry"
+. "$(dirname "$0")/e2e_lib.sh"
+private_emulation e2e-watch
 # Ticks of 300 ms: watch (which looks every 100 ms) sees every publish.
 export SKYVANE_TIME_SCALE=0.3
 SOCKET="skyvane-e2e-watch-$$"
-SVC_PID=
-cleanup() {
-  tmux -L "$SOCKET" kill-server 2>/dev/null
-  rm -f "${TMUX_TMPDIR:-/tmp}/tmux-$(id -u)/$SOCKET"
-  [ -n "$SVC_PID" ] && kill -9 "$SVC_PID" 2>/dev/null
-  rm -rf "$WORK"
-}
-trap cleanup EXIT
-trap "exit 1" INT TERM HUP PIPE
+CLEANUP='tmux -L "$SOCKET" kill-server 2>/dev/null; rm -f "${TMUX_TMPDIR:-/tmp}/tmux-$(id -u)/$SOCKET"'
 screen() { tmux -L "$SOCKET" capture-pane -p -t watch; }
-fail() {
-  echo "FAIL: $*"
-  echo "--- screen"
-  screen
-  for f in "$WORK"/*.txt; do [ -f "$f" ] && { echo "--- $f"; cat "$f"; }; done
-  exit 1
-}
-# Polls the screen until it has a line matching the extended regex: true
-# once it does, false after $3 tenths of a second (default 600).
-appears() {
-  i=0
-  until screen | grep -Eq -- "$1"; do
-    i=$((i + 1))
-    [ $i -gt "${2:-600}" ] && return 1
-    sleep 0.1
-  done
-}
+SHOW='echo "--- screen"; screen'
+# True once the screen has a line matching the extended regex, false after
+# $2 tenths of a second (default 600).
+on_screen() { screen | grep -Eq -- "$1"; }
+appears() { within "${2:-600}" on_screen "$1"; }
 shows() { appears "$1" || fail "the screen never showed /$1/ ($2)"; }
 # Presses a button until the screen shows the pattern: a press that comes
 # while the service reopens the drive's channel (a rescan) is lost, as on
@@ -65,9 +44,8 @@ refused() {
 refused list # no service running yet
 grep -q "no simulated machine answers" "$WORK/err.txt" || fail "no-service message"
 
-"$SVC" -debug >"$WORK/service.txt" 2>&1 &
-SVC_PID=$!
-"$CLIENT" status --wait-open --wait-status 102 --timeout-ms 60000 >/dev/null 2>&1 || fail "service never ready"
+start_service
+client status --wait-open --wait-status 102 --timeout-ms 60000 >/dev/null 2>&1 || fail "service never ready"
 
 tmux -L "$SOCKET" new-session -d -s watch -x 132 -y 60 \
   -e SKYVANE_NAMESPACE="$SKYVANE_NAMESPACE" -e SKYVANE_TIME_SCALE="$SKYVANE_TIME_SCALE" \
@@ -94,12 +72,8 @@ sim release E
 
 # A surprise removal, and the sleep state of another drive.
 sim unplug firewire
-i=0
-while drive_rows | grep -q " H: "; do
-  i=$((i + 1))
-  [ $i -gt 600 ] && fail "H: still listed after the unplug"
-  sleep 0.1
-done
+h_gone() { ! drive_rows | grep -q " H: "; }
+within 600 h_gone || fail "H: still listed after the unplug"
 sim sleep enclosure 2
 shows "^  [0-9]+ +I: .* 2 *$" "sleep state 2 on I:"
 
@@ -148,14 +122,6 @@ grep -q "$(printf '\033')" "$WORK/plain.txt" && fail "escape codes in plain outp
 # and event polls pend until cancelled).
 sim fault enclosure hang
 sim press enclosure eject
-kill -INT $SVC_PID
-i=0
-while kill -0 $SVC_PID 2>/dev/null; do
-  i=$((i + 1))
-  [ $i -gt 300 ] && fail "the service did not stop with a hung device"
-  sleep 0.1
-done
-wait $SVC_PID || fail "service exit code $?"
-SVC_PID=
+stop_service 300
 shows "status word 500: stopped" "stopped"
 echo "e2e watch: ok"
