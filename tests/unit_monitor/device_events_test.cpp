@@ -37,6 +37,10 @@ InterfaceEvent Interface(const GUID& interfaceClass, WideView name = WSTR("\\\\?
 
 class DeviceEvents : public MonitorFixture {
  protected:
+  DeviceEvents() {
+    volume_.dbch_size = sizeof(volume_);
+    volume_.dbch_devicetype = DBT_DEVTYP_VOLUME;
+  }
   Requests Handle(DWORD type, const void* record) {
     const Requests before = Current();
     HandleDeviceEvent(type, record, nullptr);
@@ -44,19 +48,17 @@ class DeviceEvents : public MonitorFixture {
     return {after.refreshRequests - before.refreshRequests, after.driveListStale,
             after.deviceChangePending, after.removalCheckRequested};
   }
+  DEV_BROADCAST_HDR volume_ = {};
+  const InterfaceEvent disk_ = Interface(kDiskInterfaceClass);
+  const InterfaceEvent usb_ = Interface(kUsbDeviceInterfaceClass);
 };
 
 // Each row: the event, its record, and what it asks for (refreshes added,
 // then the three flags), starting from clear flags.
 TEST_F(DeviceEvents, EachEventAsksForWhatItsKindNeeds) {
-  DEV_BROADCAST_HDR volume = {};
-  volume.dbch_size = sizeof(volume);
-  volume.dbch_devicetype = DBT_DEVTYP_VOLUME;
   GUID hidClass;
   ASSERT_TRUE(GetHidClassGuid(&hidClass));
-  const InterfaceEvent disk = Interface(kDiskInterfaceClass);
   const InterfaceEvent volumeInterface = Interface(kVolumeInterfaceClass);
-  const InterfaceEvent usb = Interface(kUsbDeviceInterfaceClass);
   const InterfaceEvent hid = Interface(hidClass);
   const InterfaceEvent vendor = Interface(kVendorClassB);
   // The name test comes before the storage classes and is case-sensitive.
@@ -69,18 +71,18 @@ TEST_F(DeviceEvents, EachEventAsksForWhatItsKindNeeds) {
     const void* record;
     Requests expected;
   } cases[] = {
-      {"volume arrival", DBT_DEVICEARRIVAL, &volume, {1, 1, 0, 0}},
-      {"volume removal", DBT_DEVICEREMOVECOMPLETE, &volume, {0, 1, 0, 1}},
-      {"disk arrival", DBT_DEVICEARRIVAL, &disk, {1, 0, 0, 0}},
-      {"disk removal", DBT_DEVICEREMOVECOMPLETE, &disk, {0, 1, 0, 1}},
+      {"volume arrival", DBT_DEVICEARRIVAL, &volume_, {1, 1, 0, 0}},
+      {"volume removal", DBT_DEVICEREMOVECOMPLETE, &volume_, {0, 1, 0, 1}},
+      {"disk arrival", DBT_DEVICEARRIVAL, &disk_, {1, 0, 0, 0}},
+      {"disk removal", DBT_DEVICEREMOVECOMPLETE, &disk_, {0, 1, 0, 1}},
       {"volume interface removal", DBT_DEVICEREMOVECOMPLETE, &volumeInterface, {0, 1, 0, 1}},
-      {"usb arrival", DBT_DEVICEARRIVAL, &usb, {0, 1, 1, 0}},
-      {"usb removal", DBT_DEVICEREMOVECOMPLETE, &usb, {0, 1, 1, 0}},
+      {"usb arrival", DBT_DEVICEARRIVAL, &usb_, {0, 1, 1, 0}},
+      {"usb removal", DBT_DEVICEREMOVECOMPLETE, &usb_, {0, 1, 1, 0}},
       {"hid arrival", DBT_DEVICEARRIVAL, &hid, {1, 0, 0, 0}},
       {"vendor class removal", DBT_DEVICEREMOVECOMPLETE, &vendor, {0, 0, 0, 1}},
       {"SES name removal", DBT_DEVICEREMOVECOMPLETE, &named, {0, 0, 0, 1}},
       {"lower-case ses name", DBT_DEVICEARRIVAL, &lower, {0, 1, 1, 0}},
-      {"query remove", DBT_DEVICEQUERYREMOVE, &disk, {0, 0, 0, 0}},
+      {"query remove", DBT_DEVICEQUERYREMOVE, &disk_, {0, 0, 0, 0}},
       {"nodes changed", DBT_DEVNODES_CHANGED, nullptr, {0, 0, 0, 0}},
       {"unknown class", DBT_DEVICEARRIVAL, &other, {0, 0, 0, 0}},
       // Forwarded by the application: the record is never read.
@@ -96,14 +98,9 @@ TEST_F(DeviceEvents, EachEventAsksForWhatItsKindNeeds) {
 
 // The flags are the monitor's: every path that sets them waits for the mutex.
 TEST_F(DeviceEvents, FlagsAreSetUnderTheStateMutex) {
-  DEV_BROADCAST_HDR volume = {};
-  volume.dbch_size = sizeof(volume);
-  volume.dbch_devicetype = DBT_DEVTYP_VOLUME;
-  const InterfaceEvent disk = Interface(kDiskInterfaceClass);
-  const InterfaceEvent usb = Interface(kUsbDeviceInterfaceClass);
-  const std::pair<DWORD, const void*> events[] = {{DBT_DEVICEREMOVECOMPLETE, &volume},
-                                                  {DBT_DEVICEREMOVECOMPLETE, &disk},
-                                                  {DBT_DEVICEARRIVAL, &usb}};
+  const std::pair<DWORD, const void*> events[] = {{DBT_DEVICEREMOVECOMPLETE, &volume_},
+                                                  {DBT_DEVICEREMOVECOMPLETE, &disk_},
+                                                  {DBT_DEVICEARRIVAL, &usb_}};
   for (const auto& [type, record] : events) {
     EXPECT_TRUE(lockprobe::WaitsForTheStateMutex([&] { HandleDeviceEvent(type, record, nullptr); }))
         << type;

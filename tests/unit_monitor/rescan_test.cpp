@@ -26,9 +26,18 @@ class Rescan : public MonitorFixture {
   }
 };
 
-TEST_F(Rescan, SuspendForgetsGaugesAndStopsWorkersWithoutRescanning) {
-  HandleForwardedMessage(0x218, 4, 0, nullptr);
+// Forwarded power messages: suspend forgets the gauges and stops the workers
+// without a rescan, resume rebuilds everything; other messages change nothing,
+// and a forwarded device change is classified without reading its record
+// (the second parameter points into the application's memory).
+TEST_F(Rescan, ForwardedMessagesSuspendResumeOrClassify) {
   StateBlock* block = monitorState.stateBlock;
+  HandleForwardedMessage(0x218, 5, 0, nullptr);
+  HandleForwardedMessage(0x100, 7, 0, nullptr);
+  EXPECT_EQ(block->statusWord, 101u);
+  EXPECT_EQ(block->drives[0].gaugePercent, 40u);
+
+  HandleForwardedMessage(0x218, 4, 0, nullptr);
   EXPECT_EQ(block->drives[0].gaugePercent, 0u);
   EXPECT_EQ(block->drives[1].gaugePercent, 0u);
   EXPECT_EQ(block->drives[2].gaugePercent, 9u) << "only records below driveCount are touched";
@@ -36,14 +45,11 @@ TEST_F(Rescan, SuspendForgetsGaugesAndStopsWorkersWithoutRescanning) {
   EXPECT_EQ(monitorState.publishNeeded, 1u);
   EXPECT_EQ(monitorState.rescanCount, 0u);
   EXPECT_EQ(block->channelCount, 1) << "the channel table is kept until the next rescan";
-}
 
-TEST_F(Rescan, ResumeRebuildsEverything) {
   for (ULONG_PTR resume : {ULONG_PTR{6}, ULONG_PTR{7}, ULONG_PTR{0x12}}) {
-    monitorState.stateBlock->statusWord = 101;
+    block->statusWord = 101;
     const DWORD before = monitorState.rescanCount;
     HandleForwardedMessage(0x218, resume, 0, nullptr);
-    StateBlock* block = monitorState.stateBlock;
     EXPECT_EQ(monitorState.rescanCount, before + 1) << resume;
     EXPECT_EQ(block->statusWord, 102u);
     EXPECT_EQ(monitorState.rescanInProgress, 0u);
@@ -53,22 +59,12 @@ TEST_F(Rescan, ResumeRebuildsEverything) {
     EXPECT_EQ(block->channels[0].linkedDrive, -1);
     EXPECT_EQ(block->channels[0].gaugePercentSent, 0u);
   }
-}
 
-TEST_F(Rescan, OtherMessagesChangeNothing) {
-  HandleForwardedMessage(0x218, 5, 0, nullptr);
-  HandleForwardedMessage(0x100, 7, 0, nullptr);
-  EXPECT_EQ(monitorState.stateBlock->statusWord, 101u);
-  EXPECT_EQ(monitorState.stateBlock->drives[0].gaugePercent, 40u);
-  EXPECT_EQ(monitorState.rescanCount, 0u);
-}
-
-TEST_F(Rescan, ForwardedDeviceChangeIsClassifiedWithoutItsRecord) {
-  // The second parameter points into the application's memory: never read.
   HandleForwardedMessage(0x219, 0x8004, 0x12345678, nullptr);
   EXPECT_EQ(monitorState.removalCheckRequested, 1u);
+  const DWORD refreshes = monitorState.refreshRequests;
   HandleForwardedMessage(0x219, 0x8000, 0x12345678, nullptr);
-  EXPECT_EQ(monitorState.refreshRequests, 1u);
+  EXPECT_EQ(monitorState.refreshRequests, refreshes + 1);
 }
 
 TEST_F(Rescan, RemovalCheckCutShortByAStopSendsNoDriveGone) {
@@ -103,13 +99,10 @@ TEST_F(Rescan, RestartWaitsForARescanOrQuiesceInProgress) {
   EXPECT_EQ(StopWorkers(), 0u);
 }
 
-TEST_F(Rescan, StopWorkersWithNoneRunningOnlySets102) {
-  EXPECT_EQ(StopWorkers(), 0u);
-  EXPECT_EQ(monitorState.stateBlock->statusWord, 102u);
-}
-
 TEST_F(Rescan, CountedDrivesCheckReportsUncountedDrivesAndSets102Once) {
   StateBlock* block = monitorState.stateBlock;
+  EXPECT_EQ(StopWorkers(), 0u) << "none running";
+  EXPECT_EQ(block->statusWord, 102u);
   block->countedDrives = 1;
   EXPECT_FALSE(CountedDrivesCheck());
   EXPECT_EQ(block->statusWord, 100u);
