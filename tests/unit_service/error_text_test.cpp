@@ -17,48 +17,27 @@ std::string TextFor(DWORD error, DWORD bufferBytes) {
   return WideToUtf8(WideView(buffer));
 }
 
-TEST(LastErrorText, SystemTextWithoutLineBreakThenHexCode) {
+// The system text without its line break, then the code in hex; empty when
+// the text does not fit in the buffer's size in bytes less 14 or there is no
+// text; cut to the buffer and terminated when it fits only that margin.
+TEST(LastErrorText, SystemTextThenHexCodeWithinTheBuffer) {
   const std::string text = TextFor(ERROR_SERVICE_EXISTS, 256);
   ASSERT_GT(text.size(), 8u);
   EXPECT_EQ(text.substr(text.size() - 8), " (0x431)");
-  EXPECT_EQ(text.find('\r'), std::string::npos);
-  EXPECT_EQ(text.find('\n'), std::string::npos);
+  EXPECT_EQ(text.find_first_of("\r\n"), std::string::npos);
   EXPECT_NE(text[0], ' ');
-}
-
-TEST(LastErrorText, EmptyWhenTheTextDoesNotFitOrDoesNotExist) {
+  EXPECT_EQ(TextFor(0x20001234, 256), "");
   // The system text with its line break is the result less " (0x431)" plus 2.
-  const std::size_t textLength = TextFor(ERROR_SERVICE_EXISTS, 256).size() - 8 + 2;
-  // The text may take up the buffer's size in bytes less 14, no more.
+  const std::size_t textLength = text.size() - 8 + 2;
   EXPECT_EQ(TextFor(ERROR_SERVICE_EXISTS, static_cast<DWORD>(textLength + 13)), "");
   EXPECT_NE(TextFor(ERROR_SERVICE_EXISTS, static_cast<DWORD>(textLength + 14)), "");
-  // A code with no system message.
-  EXPECT_EQ(TextFor(0x20001234, 256), "");
-}
-
-TEST(LastErrorText, CutToTheBufferAndTerminated) {
+  // A buffer of exactly as many bytes as the text leaves one unit short.
   WCHAR buffer[128];
   for (WCHAR& unit : buffer) unit = 'x';
   SetLastError(ERROR_SERVICE_EXISTS);
-  const std::size_t full = WideLength(LastErrorText(buffer, 256));
-  ASSERT_GT(full, 10u);
-  // A buffer of exactly as many bytes as the text leaves one unit short,
-  // as long as the text still passes the 14-byte margin.
-  for (WCHAR& unit : buffer) unit = 'x';
-  const DWORD bytes = static_cast<DWORD>(full * sizeof(WCHAR));
-  SetLastError(ERROR_SERVICE_EXISTS);
-  LastErrorText(buffer, bytes);
-  EXPECT_EQ(WideLength(buffer, 128), full - 1);
-  EXPECT_EQ(buffer[full], 'x') << "wrote beyond the stated buffer size";
-}
-
-TEST(ReportServiceStatus, DebugModeReportsNothing) {
-  const bool saved = debugMode;
-  debugMode = true;
-  const DWORD checkPoint = nextCheckPoint;
-  EXPECT_TRUE(ReportServiceStatus(SERVICE_START_PENDING, 0, 3000));
-  EXPECT_EQ(nextCheckPoint, checkPoint);
-  debugMode = saved;
+  LastErrorText(buffer, static_cast<DWORD>(text.size() * sizeof(WCHAR)));
+  EXPECT_EQ(WideLength(buffer, 128), text.size() - 1);
+  EXPECT_EQ(buffer[text.size()], 'x') << "wrote beyond the stated buffer size";
 }
 
 // The handler passes a device event on only under the lock whose holder ends
@@ -67,6 +46,9 @@ TEST(ServiceControlHandler, EventsAndReportsWaitForTheirLocks) {
   InitializeProcessLocks();
   const bool saved = debugMode;
   debugMode = true;
+  const DWORD checkPoint = nextCheckPoint;
+  EXPECT_TRUE(ReportServiceStatus(SERVICE_START_PENDING, 0, 3000));
+  EXPECT_EQ(nextCheckPoint, checkPoint) << "reported in debug mode";
   EXPECT_TRUE(lockprobe::WaitsForTheSection(&deviceEventLock, [] {
     ServiceControlHandler(SERVICE_CONTROL_DEVICEEVENT, DBT_DEVICEARRIVAL, nullptr, nullptr);
   }));
