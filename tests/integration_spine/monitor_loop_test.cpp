@@ -1,171 +1,22 @@
-// RunMonitor on a thread of its own, observed through its pass and publish
-// hooks. Each case scripts the loop from the pass hook, which runs on the
+// The monitor loop run whole, scripted from its pass hook, which runs on the
 // monitor thread between passes, so the sequence of passes is deterministic.
-#include <gtest/gtest.h>
-
 #include <atomic>
-#include <chrono>
-#include <condition_variable>
-#include <cstdio>
-#include <cstdlib>
-#include <functional>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
 
-#include "machine.h"
-#include "monitor/channel_workers.h"
-#include "monitor/monitor_state.h"
+#include "integration_spine/monitor_run.h"
 #include "monitor/rescan.h"
-#include "monitor/state_lock.h"
 #include "pipe/pipe_client.h"
 #include "platform/diagnostics.h"
 #include "platform/posix/emu_scm.h"
-#include "service/process_locks.h"
-#include "service/service_host.h"
 #include "support/test_support.h"
 
 namespace {
 
-// One-second passes take 10 ms; set before the emulation's first wait.
-const bool kTimeScaled = [] {
-  setenv("SKYVANE_TIME_SCALE", "0.01", 0);
-  return true;
-}();
-
-struct Pass {
-  PassKind kind;
-  DWORD tick;
-  DWORD sequence;
-  DWORD statusWord;
-  DWORD rescans;
-};
-
-// What the hooks saw; `script` runs after every pass on the monitor thread
-// and may change the monitor's flags (under the mutex) or stop it.
-struct Observer {
-  std::mutex lock;
-  std::condition_variable changed;
-  std::vector<Pass> passes;
-  std::vector<DWORD> publishedStatus;  // statusWord of every copy into the mapping
-  std::function<void(const std::vector<Pass>&)> script;
-  bool finished = false;
-};
-Observer* observer = nullptr;
-
-void AfterPass(PassKind kind) {
-  Pass pass{kind, 0, 0, 0, 0};
-  {
-    StateLock lock;
-    pass.tick = monitorState.tick;
-    pass.sequence = monitorState.stateBlock->sequence;
-    pass.statusWord = monitorState.stateBlock->statusWord;
-    pass.rescans = monitorState.rescanCount;
-  }
-  std::vector<Pass> seen;
-  {
-    std::lock_guard<std::mutex> guard(observer->lock);
-    observer->passes.push_back(pass);
-    seen = observer->passes;
-  }
-  if (observer->script) observer->script(seen);
-}
-
-void AfterPublish(const StateBlock* block) {
-  std::lock_guard<std::mutex> guard(observer->lock);
-  observer->publishedStatus.push_back(block->statusWord);
-}
-
-class MonitorLoop : public ::testing::Test {
- protected:
-  void SetUp() override {
-    ASSERT_TRUE(kTimeScaled);
-    InitializeProcessLocks();
-    debugMode = true;  // no service control manager: status reports are skipped
-    observer = &observer_;
-    monitorHooks.afterPass = AfterPass;
-    monitorHooks.afterPublish = AfterPublish;
-  }
-  void TearDown() override {
-    if (monitor_.joinable()) {
-      StopMonitor();
-      monitor_.join();
-    }
-    monitorHooks = MonitorHooks{};
-    observer = nullptr;
-    debugMode = true;
-    if (machine_ != nullptr) {
-      machine_->ClearFaults();
-      machine_->FinishHeldCancels();
-      machine_->Uninstall();
-    }
-  }
-  // Runs the monitor until `script` stops it; returns when RunMonitor did.
-  void Run(std::function<void(const std::vector<Pass>&)> script) {
-    Start(std::move(script));
-    Finish();
-  }
-  void Start(std::function<void(const std::vector<Pass>&)> script) {
-    observer_.script = std::move(script);
-    monitor_ = std::thread([this] {
-      RunMonitor(0, nullptr);
-      std::lock_guard<std::mutex> guard(observer_.lock);
-      observer_.finished = true;
-      observer_.changed.notify_all();
-    });
-  }
-  // Waits for RunMonitor to return; a monitor that never stops ends the
-  // program, since its thread cannot be joined.
-  void Finish() {
-    std::unique_lock<std::mutex> guard(observer_.lock);
-    if (!observer_.changed.wait_for(guard, std::chrono::seconds(60),
-                                    [this] { return observer_.finished; })) {
-      std::fprintf(stderr, "the monitor did not stop\n");
-      std::abort();
-    }
-    guard.unlock();
-    monitor_.join();
-  }
-  // Waits (real time, guarded) until `done` holds.
-  static bool WaitUntil(const std::function<bool()>& done) {
-    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
-    while (!done()) {
-      if (std::chrono::steady_clock::now() > deadline) return false;
-      std::this_thread::sleep_for(std::chrono::milliseconds(2));
-    }
-    return true;
-  }
-  std::size_t PassCount() {
-    std::lock_guard<std::mutex> guard(observer_.lock);
-    return observer_.passes.size();
-  }
-  // Installs the embedded default machine: one drive per channel kind.
-  void InstallDefaultMachine() {
-    std::string error;
-    machine_ = sim::LoadMachine(sim::DefaultMachineText(), &error);
-    ASSERT_NE(machine_, nullptr) << error;
-    machine_->SetDeviceEventSink([](DWORD, const void*) {});
-    machine_->Install();
-  }
-  static DWORD Read(DWORD MonitorState::*flag) {
-    StateLock lock;
-    return monitorState.*flag;
-  }
-  static void Set(DWORD MonitorState::*flag, DWORD value) {
-    StateLock lock;
-    monitorState.*flag = value;
-  }
-  static std::size_t Count(const std::vector<Pass>& passes, PassKind kind) {
-    std::size_t count = 0;
-    for (const Pass& pass : passes) count += pass.kind == kind ? 1 : 0;
-    return count;
-  }
-  Observer observer_;
-  std::thread monitor_;
-  std::unique_ptr<sim::Machine> machine_;
-};
+using monitorrun::Pass;
+using MonitorLoop = monitorrun::MonitorRun;
 
 TEST_F(MonitorLoop, WithoutDrivesPublishesEveryFifthTickAndStopsCleanly) {
   // What an earlier run in this process may have left behind: a new run
@@ -175,11 +26,9 @@ TEST_F(MonitorLoop, WithoutDrivesPublishesEveryFifthTickAndStopsCleanly) {
   monitorState.tick = 2999;
   // Threads are checked after every case by the test main's leak check.
   const long handles = platform::LiveHandleCount();
-  Run([](const std::vector<Pass>& passes) {
-    if (passes.size() == 23) StopMonitor();
-  });
+  Run([](const std::vector<Pass>& passes) { return passes.size() == 23; });
   // The stop is noticed at the top of the next pass and leaves nothing behind.
-  const std::vector<Pass>& passes = observer_.passes;
+  const std::vector<Pass>& passes = passes_;
   ASSERT_EQ(passes.size(), 23u) << "a pass ran after the stop";
   EXPECT_EQ(monitorState.stateBlock, nullptr);
   EXPECT_EQ(monitorState.stateMutex, nullptr);
@@ -192,8 +41,8 @@ TEST_F(MonitorLoop, WithoutDrivesPublishesEveryFifthTickAndStopsCleanly) {
   EXPECT_EQ(passes.back().tick, 24u);
   // The first rescan ended with 102; the last publish is the stop's 500.
   EXPECT_EQ(passes.front().statusWord, 102u);
-  ASSERT_FALSE(observer_.publishedStatus.empty());
-  EXPECT_EQ(observer_.publishedStatus.back(), 500u);
+  ASSERT_FALSE(published_.empty());
+  EXPECT_EQ(published_.back(), 500u);
 }
 
 TEST_F(MonitorLoop, PauseFreezesTheTickAndEndsAfterSixtyPassesWithARescan) {
@@ -201,11 +50,11 @@ TEST_F(MonitorLoop, PauseFreezesTheTickAndEndsAfterSixtyPassesWithARescan) {
     if (passes.size() == 2) Set(&MonitorState::paused, 1);
     if (passes.size() > 2 && passes.back().kind == PassKind::Regular &&
         passes[passes.size() - 2].kind == PassKind::Paused) {
-      StopMonitor();
+      return true;
     }
-    if (passes.size() > 200) StopMonitor();
+    return passes.size() > 200;
   });
-  const std::vector<Pass>& passes = observer_.passes;
+  const std::vector<Pass>& passes = passes_;
   ASSERT_EQ(Count(passes, PassKind::Paused), 60u);
   const DWORD frozen = passes[1].tick;
   for (std::size_t i = 2; i < 62; ++i) {
@@ -246,17 +95,15 @@ TEST_F(MonitorLoop, RequestsTakePassesOfTheirOwnAndTheTickWraps) {
         Set(&MonitorState::tick, 2999);
         break;
       case 22: {
-        std::lock_guard<std::mutex> guard(observer_.lock);
-        publishesBefore = observer_.publishedStatus.size();
+        std::lock_guard<std::mutex> guard(lock_);
+        publishesBefore = published_.size();
       }
         RequestRefresh();
         break;
-      case 24:
-        StopMonitor();
-        break;
     }
+    return passes.size() == 24;
   });
-  const std::vector<Pass>& passes = observer_.passes;
+  const std::vector<Pass>& passes = passes_;
   ASSERT_EQ(passes.size(), 24u);
   // S skipped, D device change, W workers restart, C removal check. The flags
   // become a refresh on a pass that does not sleep or advance the tick; one
@@ -273,8 +120,8 @@ TEST_F(MonitorLoop, RequestsTakePassesOfTheirOwnAndTheTickWraps) {
     EXPECT_EQ(passes[i].rescans, passes[0].rescans + rescans[i]);
   }
   // The refresh is published as 101, then 102 when its rescan ends.
-  std::vector<DWORD> after(observer_.publishedStatus.begin() + static_cast<long>(publishesBefore),
-                           observer_.publishedStatus.end());
+  std::vector<DWORD> after(published_.begin() + static_cast<long>(publishesBefore),
+                           published_.end());
   ASSERT_GE(after.size(), 3u);
   EXPECT_EQ(after[0], 101u);
   EXPECT_EQ(after[1], 102u);
@@ -288,7 +135,7 @@ TEST_F(MonitorLoop, AProgramThatKeepsTheMutexCannotKeepTheStopFromEnding) {
   std::atomic<bool> release{false};
   std::thread holder;
   Run([&](const std::vector<Pass>& passes) {
-    if (passes.size() != 2) return;
+    if (passes.size() != 2) return false;
     holder = std::thread([&] {
       const HANDLE mutex = OpenMutexW(SYNCHRONIZE | MUTEX_MODIFY_STATE, FALSE, kStateMutexName);
       WaitForSingleObject(mutex, INFINITE);
@@ -298,11 +145,11 @@ TEST_F(MonitorLoop, AProgramThatKeepsTheMutexCannotKeepTheStopFromEnding) {
       CloseHandle(mutex);
     });
     while (!taken) Sleep(1);
-    StopMonitor();
+    return true;
   });
   release = true;
   holder.join();
-  EXPECT_NE(observer_.publishedStatus.back(), 500u) << "the block was written without the mutex";
+  EXPECT_NE(published_.back(), 500u) << "the block was written without the mutex";
   EXPECT_EQ(monitorState.stateMutex, nullptr);
 }
 
@@ -313,9 +160,7 @@ TEST_F(MonitorLoop, ExistingSharedObjectsAreUsedAndOutliveTheService) {
                                       kStateBlockSize, kFileMapName);
   ASSERT_NE(mutex, nullptr);
   ASSERT_NE(mapping, nullptr);
-  Run([](const std::vector<Pass>& passes) {
-    if (passes.size() == 2) StopMonitor();
-  });
+  Run([](const std::vector<Pass>& passes) { return passes.size() == 2; });
   void* view = MapViewOfFile(mapping, FILE_MAP_READ, 0, 0, kStateBlockSize);
   ASSERT_NE(view, nullptr);
   const StateBlock* block = static_cast<const StateBlock*>(view);
@@ -335,9 +180,9 @@ TEST_F(MonitorLoop, FailedStartUpTearsDownWithoutRunningTheLoop) {
   HANDLE squatter = CreateEventW(nullptr, TRUE, FALSE, kFileMapName);
   ASSERT_NE(squatter, nullptr);
   const long handles = platform::LiveHandleCount();
-  Run([](const std::vector<Pass>&) { StopMonitor(); });
-  EXPECT_TRUE(observer_.passes.empty());
-  EXPECT_TRUE(observer_.publishedStatus.empty());
+  Run([](const std::vector<Pass>&) { return true; });
+  EXPECT_TRUE(passes_.empty());
+  EXPECT_TRUE(published_.empty());
   EXPECT_EQ(platform::LiveHandleCount(), handles);
   CloseHandle(squatter);
 }
@@ -346,16 +191,13 @@ TEST_F(MonitorLoop, StopAskedForBeforeTheRunEndsItAtOnceAndReachesTheApplication
   skytest::Handle uiStop(CreateEventW(nullptr, FALSE, FALSE, kUiStopEventName));
   ASSERT_TRUE(uiStop);
   StopMonitor();  // before RunMonitor created any of its events
-  Run([](const std::vector<Pass>&) { StopMonitor(); });
-  EXPECT_TRUE(observer_.passes.empty()) << "the early stop was lost";
+  Run([](const std::vector<Pass>&) { return true; });
+  EXPECT_TRUE(passes_.empty()) << "the early stop was lost";
   EXPECT_EQ(WaitForSingleObject(uiStop.Get(), 0), WAIT_OBJECT_0);
   // The stop was used up by that run: the next one runs until stopped.
-  observer_.passes.clear();
-  observer_.finished = false;
-  Run([](const std::vector<Pass>& passes) {
-    if (passes.size() == 2) StopMonitor();
-  });
-  EXPECT_EQ(observer_.passes.size(), 2u);
+  passes_.clear();
+  Run([](const std::vector<Pass>& passes) { return passes.size() == 2; });
+  EXPECT_EQ(passes_.size(), 2u);
 }
 
 TEST_F(MonitorLoop, PlantedSmallMappingIsReportedOnceAndReplacedWhenFreed) {
@@ -370,14 +212,14 @@ TEST_F(MonitorLoop, PlantedSmallMappingIsReportedOnceAndReplacedWhenFreed) {
       CloseHandle(planted);
       planted = nullptr;
     }
-    if (passes.size() == 16) StopMonitor();
+    return passes.size() == 16;
   });
-  const std::vector<Pass>& passes = observer_.passes;
+  const std::vector<Pass>& passes = passes_;
   ASSERT_EQ(passes.size(), 16u);
   EXPECT_EQ(passes[7].sequence, 0u) << "something was published into the small mapping";
   EXPECT_GT(passes.back().sequence, 0u) << "the service did not take the name back";
-  ASSERT_FALSE(observer_.publishedStatus.empty());
-  EXPECT_EQ(observer_.publishedStatus.back(), 500u);
+  ASSERT_FALSE(published_.empty());
+  EXPECT_EQ(published_.back(), 500u);
   std::size_t reports = 0;
   for (const emu::EventLogEntry& entry : emu::EventLogEntries()) {
     for (const std::u16string& text : entry.strings) {
@@ -388,8 +230,8 @@ TEST_F(MonitorLoop, PlantedSmallMappingIsReportedOnceAndReplacedWhenFreed) {
 }
 
 TEST_F(MonitorLoop, StopDuringAForwardedResumeWithAHungWorkerEndsWith500) {
-  InstallDefaultMachine();
-  Start([](const std::vector<Pass>&) {});
+  Install(Load());
+  Start(nullptr);
   ASSERT_TRUE(WaitUntil([this] { return PassCount() >= 1; }));
   // The loop idles, so that only the rescan meets the device below.
   Set(&MonitorState::skipTicks, 1000000);
@@ -421,13 +263,13 @@ TEST_F(MonitorLoop, StopDuringAForwardedResumeWithAHungWorkerEndsWith500) {
   Finish();
   client.join();
   ASSERT_TRUE(hung) << "the rescan never reached the enclosure";
-  ASSERT_FALSE(observer_.publishedStatus.empty());
-  EXPECT_EQ(observer_.publishedStatus.back(), 500u) << "a command published after the stop";
+  ASSERT_FALSE(published_.empty());
+  EXPECT_EQ(published_.back(), 500u) << "a command published after the stop";
 }
 
 TEST_F(MonitorLoop, WorkerRestartWaitsForAQuiesceAndARescanStopsRunningWorkers) {
-  InstallDefaultMachine();
-  Start([](const std::vector<Pass>&) {});
+  Install(Load());
+  Start(nullptr);
   ASSERT_TRUE(WaitUntil([this] {
     return PassCount() >= 1 && machine_->PendingCount("firewire", sim::Endpoint::Driver) >= 1;
   }));
@@ -440,7 +282,10 @@ TEST_F(MonitorLoop, WorkerRestartWaitsForAQuiesceAndARescanStopsRunningWorkers) 
     return workerState.workerCount == 0;
   }));
   Set(&MonitorState::workersRestartRequested, 1);
-  EXPECT_TRUE(WaitUntil([] { return Read(&MonitorState::workersRestartRequested) == 0; }));
+  EXPECT_TRUE(WaitUntil([] {
+    StateLock lock;
+    return monitorState.workersRestartRequested == 0;
+  }));
   machine_->FinishHeldCancels();
   machine_->SetCancelDelay("firewire", sim::Endpoint::Driver, 0);
   suspend.join();
@@ -465,7 +310,7 @@ TEST_F(MonitorLoop, WorkerRestartWaitsForAQuiesceAndARescanStopsRunningWorkers) 
 }
 
 TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
-  InstallDefaultMachine();
+  Install(Load());
   // The firewire drive answers a status that keeps it out of the published
   // list; its record keeps the index 0 of another drive's copy.
   const std::uint8_t notPublishable[4] = {0x4A, 0x00, 0x00, 0x00};
@@ -492,7 +337,7 @@ TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
       }
     }
     seen.push_back(now);
-    if (passes.size() == 12) StopMonitor();
+    return passes.size() == 12;
   });
   ASSERT_EQ(seen.size(), 12u);
   ASSERT_GE(seen.back().publishedCount, 1);

@@ -1,110 +1,23 @@
-// RunMonitor on a thread of its own with its channel workers, on the embedded
-// default machine and on a machine whose drives are all of channel models.
-// Each case scripts the run from the monitor's pass hook (monitor thread,
-// mutex released) and copies what it checks out of the working block there,
-// since the block is freed when the monitor ends.
-#include <gtest/gtest.h>
-
+// The whole monitor with its channel workers, on the embedded default machine
+// and on machines whose drives are all of channel models.
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
-#include <functional>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
 
-#include "machine.h"
-#include "monitor/channel_workers.h"
-#include "monitor/monitor_state.h"
-#include "monitor/state_lock.h"
+#include "integration_spine/monitor_run.h"
 #include "platform/wide.h"
-#include "service/process_locks.h"
-#include "service/service_host.h"
 #include "transport/drive_command.h"
 #include "transport/drive_features.h"
 
 namespace {
 
-// A guard against a run that never reaches its goal: 3000 passes of 10 ms.
-constexpr std::size_t kMaxPasses = 3000;
+using monitorrun::Pass;
 
-struct Snapshot {
-  PassKind kind = PassKind::Regular;
-  DWORD statusWord = 0;
-  DWORD rescans = 0;
-  LONG driveCount = 0;
-  LONG channelCount = 0;
-  std::vector<LONG> linked;
-  std::vector<DWORD> fromChannel;
-  std::vector<DWORD> pendingAction;
-  std::vector<DWORD> lightMarker;
-  DWORD endedWorkers = 0;
-};
-
-Snapshot Take(PassKind kind) {
-  Snapshot s;
-  s.kind = kind;
-  StateLock lock;
-  const StateBlock* block = monitorState.stateBlock;
-  s.statusWord = block->statusWord;
-  s.rescans = monitorState.rescanCount;
-  s.driveCount = block->driveCount;
-  s.channelCount = block->channelCount;
-  for (LONG i = 0; i < block->channelCount; ++i) {
-    s.linked.push_back(block->channels[i].linkedDrive);
-    s.pendingAction.push_back(block->channels[i].pendingPanelAction);
-    s.lightMarker.push_back(block->channels[i].lightPulseMarker);
-  }
-  for (LONG i = 0; i < block->driveCount; ++i)
-    s.fromChannel.push_back(block->drives[i].fromChannel);
-  for (DWORD i = 0; i < workerState.workerHandleCount; ++i) {
-    s.endedWorkers += WaitForSingleObject(workerState.workerThreads[i], 0) == WAIT_OBJECT_0;
-  }
-  return s;
-}
-
-// The script sees every snapshot so far and returns true to stop the monitor.
-using Script = std::function<bool(const std::vector<Snapshot>&)>;
-Script* activeScript = nullptr;
-std::vector<Snapshot>* activeSnapshots = nullptr;
-
-void AfterPass(PassKind kind) {
-  activeSnapshots->push_back(Take(kind));
-  if ((*activeScript)(*activeSnapshots) || activeSnapshots->size() >= kMaxPasses) StopMonitor();
-}
-
-class WorkersTest : public ::testing::Test {
+class WorkersTest : public monitorrun::MonitorRun {
  protected:
-  void SetUp() override {
-    InitializeProcessLocks();
-    debugMode = true;  // no service control manager: status reports are skipped
-  }
-  void TearDown() override {
-    monitorHooks = MonitorHooks{};
-    if (machine_ != nullptr) {
-      machine_->WaitForDeviceEvents();
-      machine_->Uninstall();
-    }
-  }
-  void Install(std::unique_ptr<sim::Machine> machine) {
-    machine_ = std::move(machine);
-    machine_->SetDeviceEventSink([](DWORD, const void*) {});
-    machine_->Install();
-  }
-  // Runs the monitor until the script stops it.
-  void Run(Script script) {
-    activeScript = &script;
-    activeSnapshots = &snapshots_;
-    monitorHooks.afterPass = AfterPass;
-    std::thread monitor([] { RunMonitor(0, nullptr); });
-    monitor.join();
-    monitorHooks = MonitorHooks{};
-    activeScript = nullptr;
-    activeSnapshots = nullptr;
-    ASSERT_LT(snapshots_.size(), kMaxPasses) << "the run did not reach its goal";
-  }
   // Commands of one control code that the drive received.
   std::vector<sim::Command> Controls(const std::string& drive, DWORD code) const {
     std::vector<sim::Command> out;
@@ -113,28 +26,43 @@ class WorkersTest : public ::testing::Test {
     }
     return out;
   }
-
-  std::unique_ptr<sim::Machine> machine_;
-  std::vector<Snapshot> snapshots_;
+  // The start-up rescan ran and the drive's worker waits for an event.
+  bool Waiting(const std::vector<Pass>& passes, const char* drive,
+               sim::Endpoint endpoint = sim::Endpoint::Driver) const {
+    return passes.back().rescans >= 1 && machine_->PendingCount(drive, endpoint) >= 1;
+  }
 };
 
-std::unique_ptr<sim::Machine> DefaultMachine() {
-  std::string error;
-  std::unique_ptr<sim::Machine> machine = sim::LoadMachine(sim::DefaultMachineText(), &error);
-  EXPECT_NE(machine, nullptr) << error;
-  return machine;
+// Only drives of channel models: a button-filter-driver drive and an
+// enclosure, both IEEE 1394.
+std::unique_ptr<sim::Machine> CountedMachine() {
+  std::string text(sim::DefaultMachineText());
+  const std::size_t gauge = text.find("# USB drive of a standalone gauge model");
+  const std::size_t fireWire = text.find("# IEEE 1394 drive reached through");
+  EXPECT_NE(gauge, std::string::npos);
+  EXPECT_NE(fireWire, std::string::npos);
+  text.erase(gauge, fireWire - gauge);
+  return monitorrun::MonitorRun::Load(text);
 }
 
+// Settled, then a panel event: the plain drive is not of a channel model, so
+// the counted-drives check reports it (100) and holds back the panel actions.
 TEST_F(WorkersTest, DefaultMachineLinksEveryChannelAndStaysSettled) {
-  Install(DefaultMachine());
-  Run([](const std::vector<Snapshot>& passes) {
-    std::size_t regular = 0;
-    for (const Snapshot& s : passes) regular += s.kind == PassKind::Regular ? 1 : 0;
-    return regular >= 40;
+  Install(Load());
+  std::size_t settled = 0;  // passes before the press
+  std::size_t startCommands[3] = {};
+  Run([&](const std::vector<Pass>& passes) {
+    if (settled == 0 && Count(passes, PassKind::Regular) >= 40 && Waiting(passes, "firewire")) {
+      settled = passes.size();
+      const DWORD codes[] = {CTL_WORKER_START, CTL_CLEAR_EVENT, CTL_GET_IDENTITY};
+      for (int i = 0; i < 3; ++i) startCommands[i] = Controls("firewire", codes[i]).size();
+      machine_->Press("firewire", 0x01);
+    }
+    return settled != 0 && passes.back().statusWord == 100;
   });
-  ASSERT_FALSE(snapshots_.empty());
-  for (std::size_t i = 0; i < snapshots_.size(); ++i) {
-    const Snapshot& s = snapshots_[i];
+  ASSERT_GT(settled, 0u);
+  for (std::size_t i = 0; i < settled; ++i) {
+    const Pass& s = passes_[i];
     SCOPED_TRACE("pass " + std::to_string(i));
     EXPECT_EQ(s.rescans, 1u) << "a refresh was requested after the first rescan";
     EXPECT_EQ(s.statusWord, 102u);
@@ -144,15 +72,14 @@ TEST_F(WorkersTest, DefaultMachineLinksEveryChannelAndStaysSettled) {
     EXPECT_EQ(s.linked, (std::vector<LONG>{0, 1, 2, 3}));
     EXPECT_EQ(s.fromChannel, (std::vector<DWORD>{0, 0, 0, 0}));
   }
-  // The start commands each worker gives its channel.
-  EXPECT_EQ(Controls("firewire", CTL_WORKER_START).size(), 1u);
-  EXPECT_EQ(Controls("firewire", CTL_CLEAR_EVENT).size(), 1u);
-  EXPECT_EQ(Controls("firewire", CTL_GET_IDENTITY).size(), 1u);
+  // The start commands each worker gives its channel, once.
+  for (std::size_t count : startCommands) EXPECT_EQ(count, 1u);
   std::size_t serialQueries = 0;
   for (const sim::Command& c : machine_->Commands()) {
     serialQueries += c.kind == sim::Command::Kind::HidSerial ? 1 : 0;
   }
   EXPECT_EQ(serialQueries, 2u) << "both HID channels read their identity once";
+  EXPECT_TRUE(Controls("firewire", CTL_EVENT_REPLY).empty());
 }
 
 TEST_F(WorkersTest, DrivesThatStayIncompleteAskForOneRescanAtMost) {
@@ -178,60 +105,21 @@ drive loose
   volume L fixed 100G 50G
 end
 )";
-  std::string error;
-  std::unique_ptr<sim::Machine> machine = sim::LoadMachine(text, &error);
-  ASSERT_NE(machine, nullptr) << error;
-  Install(std::move(machine));
-  Run([](const std::vector<Snapshot>& passes) {
-    std::size_t regular = 0;
-    for (const Snapshot& s : passes) regular += s.kind == PassKind::Regular ? 1 : 0;
-    return regular >= 120;
-  });
-  ASSERT_FALSE(snapshots_.empty());
-  EXPECT_LE(snapshots_.back().rescans, 2u) << "the start-up rescan and at most one more";
-  EXPECT_EQ(snapshots_.back().statusWord, 102u);
-}
-
-TEST_F(WorkersTest, PanelEventsOnAnUncountedMachineOnlyReportTheUncountedDrive) {
-  // The plain drive is not of a channel model: the counted-drives check
-  // reports it and holds back the panel actions.
-  Install(DefaultMachine());
-  bool pressed = false;
-  Run([&](const std::vector<Snapshot>& passes) {
-    if (!pressed && passes.back().rescans >= 1 &&
-        machine_->PendingCount("firewire", sim::Endpoint::Driver) >= 1) {
-      machine_->Press("firewire", 0x01);
-      pressed = true;
-    }
-    return pressed && passes.back().statusWord == 100;
-  });
-  EXPECT_TRUE(Controls("firewire", CTL_EVENT_REPLY).empty());
-}
-
-std::unique_ptr<sim::Machine> CountedMachine() {
-  // Only drives of channel models: a button-filter-driver drive and an
-  // enclosure, both IEEE 1394.
-  std::string text(sim::DefaultMachineText());
-  const std::size_t gauge = text.find("# USB drive of a standalone gauge model");
-  const std::size_t fireWire = text.find("# IEEE 1394 drive reached through");
-  EXPECT_NE(gauge, std::string::npos);
-  EXPECT_NE(fireWire, std::string::npos);
-  text.erase(gauge, fireWire - gauge);
-  std::string error;
-  std::unique_ptr<sim::Machine> machine = sim::LoadMachine(text, &error);
-  EXPECT_NE(machine, nullptr) << error;
-  return machine;
+  Install(Load(text));
+  Run([](const std::vector<Pass>& passes) { return Count(passes, PassKind::Regular) >= 120; });
+  EXPECT_LE(passes_.back().rescans, 2u) << "the start-up rescan and at most one more";
+  EXPECT_EQ(passes_.back().statusWord, 102u);
 }
 
 TEST_F(WorkersTest, PanelEventsOnAControlChannelLightTheDriveAndSetTheAction) {
   Install(CountedMachine());
   int step = 0;
-  Run([&](const std::vector<Snapshot>& passes) {
-    const Snapshot& now = passes.back();
-    const bool waiting = machine_->PendingCount("firewire", sim::Endpoint::Driver) >= 1;
+  Run([&](const std::vector<Pass>& passes) {
+    const Pass& now = passes.back();
+    const bool waiting = Waiting(passes, "firewire");
     switch (step) {
-      case 0:  // workers running and waiting
-        if (now.rescans >= 1 && waiting) {
+      case 0:
+        if (waiting) {
           machine_->Press("firewire", 0x01);
           step = 1;
         }
@@ -250,68 +138,59 @@ TEST_F(WorkersTest, PanelEventsOnAControlChannelLightTheDriveAndSetTheAction) {
   const std::vector<sim::Command> replies = Controls("firewire", CTL_EVENT_REPLY);
   ASSERT_EQ(replies.size(), 1u);
   EXPECT_TRUE(replies[0].data.empty()) << "the reply carries no input on a driver channel";
-  const Snapshot& last = snapshots_.back();
+  const Pass& last = passes_.back();
   ASSERT_EQ(last.channelCount, 2);
   EXPECT_EQ(last.lightMarker[0], 120u);
   EXPECT_EQ(last.statusWord, 102u);
   EXPECT_EQ(last.rescans, 1u);
 }
 
-TEST_F(WorkersTest, FailedRemovalIsReportedWithTheDriveIndex) {
+// Removals refused once by the system are reported with the drive's index
+// (control channel: drive 0, storage channel: drive 1). Then the whole path of
+// a removal: the control worker dismounts the drive's volume, the eject
+// succeeds, the channel ends with the device, and the refresh it asks for
+// rebuilds the block without the drive.
+TEST_F(WorkersTest, EjectButtonRemovesTheDriveAndTheRescanForgetsIt) {
   Install(CountedMachine());
   machine_->SetEjectVeto("firewire", PNP_VetoOutstandingOpen, "test");
   machine_->SetEjectVeto("enclosure", PNP_VetoOutstandingOpen, "test");
   int step = 0;
-  Run([&](const std::vector<Snapshot>& passes) {
-    const Snapshot& now = passes.back();
-    switch (step) {
-      case 0:
-        if (now.rescans >= 1 && machine_->PendingCount("firewire", sim::Endpoint::Driver) >= 1) {
-          machine_->Press("firewire", 0x04);  // control channel, drive 0
-          step = 1;
-        }
-        return false;
-      case 1:
-        if (now.statusWord == 600) {
-          machine_->Press("enclosure", 0x04);  // storage channel, drive 1
-          step = 2;
-        }
-        return false;
-      default:
-        return now.statusWord == 601;
+  std::size_t ejectPressed = 0, ejectsBefore = 0;
+  int dismountsBefore = 0;
+  LONG drivesAfterFailures = 0;
+  Run([&](const std::vector<Pass>& passes) {
+    const Pass& now = passes.back();
+    if (step == 0 && Waiting(passes, "firewire")) {
+      machine_->Press("firewire", 0x04);
+      step = 1;
+    } else if (step == 1 && now.statusWord == 600) {
+      machine_->Press("enclosure", 0x04);
+      step = 2;
+    } else if (step == 2 && now.statusWord == 601 && Waiting(passes, "firewire")) {
+      drivesAfterFailures = now.driveCount;
+      ejectPressed = passes.size();
+      ejectsBefore = machine_->Ejects().size();
+      dismountsBefore = machine_->DismountCount('H');
+      machine_->SetEjectVeto("firewire", PNP_VetoOutstandingOpen, "test", 0);
+      machine_->Press("firewire", 0x04);
+      step = 3;
     }
+    return step == 3 && now.rescans >= 2 && now.statusWord == 102 && now.driveCount == 1;
   });
-  EXPECT_EQ(step, 2);
-  EXPECT_EQ(snapshots_.back().driveCount, 2) << "the storage worker enumerated again";
-}
-
-TEST_F(WorkersTest, EjectButtonRemovesTheDriveAndTheRescanForgetsIt) {
-  // The whole path of a removal request: the control worker dismounts the
-  // drive's volume, the eject succeeds, the drive's channel ends with the
-  // device, and the refresh it asks for rebuilds the block without it.
-  Install(CountedMachine());
-  bool pressed = false;
-  Run([&](const std::vector<Snapshot>& passes) {
-    const Snapshot& now = passes.back();
-    if (!pressed) {
-      if (now.rescans >= 1 && machine_->PendingCount("firewire", sim::Endpoint::Driver) >= 1) {
-        machine_->Press("firewire", 0x04);
-        pressed = true;
-      }
-      return false;
-    }
-    return now.rescans >= 2 && now.statusWord == 102 && now.driveCount == 1;
-  });
-  ASSERT_TRUE(pressed);
+  ASSERT_EQ(step, 3);
+  EXPECT_EQ(drivesAfterFailures, 2) << "the storage worker enumerated again";
   EXPECT_FALSE(machine_->Attached("firewire"));
   EXPECT_TRUE(machine_->Attached("enclosure"));
-  EXPECT_EQ(machine_->DismountCount('H'), 1) << "the drive's volume was taken offline first";
+  EXPECT_EQ(machine_->DismountCount('H'), dismountsBefore + 1)
+      << "the drive's volume was taken offline first";
   const std::vector<sim::Machine::EjectRequest> ejects = machine_->Ejects();
-  ASSERT_EQ(ejects.size(), 1u);
-  EXPECT_EQ(ejects[0].drive, "firewire");
-  EXPECT_FALSE(ejects[0].vetoed);
-  for (const Snapshot& s : snapshots_) EXPECT_LT(s.statusWord, 600u) << "no removal failed";
-  const Snapshot& last = snapshots_.back();
+  ASSERT_EQ(ejects.size(), ejectsBefore + 1);
+  EXPECT_EQ(ejects.back().drive, "firewire");
+  EXPECT_FALSE(ejects.back().vetoed);
+  for (std::size_t i = ejectPressed; i < passes_.size(); ++i) {
+    EXPECT_NE(passes_[i].statusWord, 600u) << "the last removal failed";
+  }
+  const Pass& last = passes_.back();
   EXPECT_EQ(last.channelCount, 1);
   EXPECT_EQ(last.linked, (std::vector<LONG>{0}));
 }
@@ -324,15 +203,12 @@ TEST_F(WorkersTest, RemovalFailingAfterTheDriveWentNamesTheDriveTheWorkerLinked)
   const std::size_t model = text.find("model-code 7B44");
   ASSERT_NE(model, std::string::npos);
   text.replace(model, 15, "model-code 7B43");
-  std::string error;
-  std::unique_ptr<sim::Machine> machine = sim::LoadMachine(text, &error);
-  ASSERT_NE(machine, nullptr) << error;
-  Install(std::move(machine));
+  Install(Load(text));
   int step = 0;
-  Run([&](const std::vector<Snapshot>& passes) {
-    const Snapshot& now = passes.back();
-    const bool waiting = machine_->PendingCount("gauge", sim::Endpoint::Hid) >= 1;
-    if (step == 0 && now.rescans >= 1 && waiting) {
+  Run([&](const std::vector<Pass>& passes) {
+    const Pass& now = passes.back();
+    const bool waiting = Waiting(passes, "gauge", sim::Endpoint::Hid);
+    if (step == 0 && waiting) {
       machine_->Press("gauge", 0x04);
       step = 1;
     } else if (step == 1 && !machine_->Ejects().empty() && now.linked[0] == -1 && waiting) {
@@ -344,7 +220,7 @@ TEST_F(WorkersTest, RemovalFailingAfterTheDriveWentNamesTheDriveTheWorkerLinked)
   const std::vector<sim::Machine::EjectRequest> ejects = machine_->Ejects();
   ASSERT_EQ(ejects.size(), 1u);
   EXPECT_FALSE(ejects[0].vetoed);
-  EXPECT_EQ(snapshots_.back().statusWord, 600u);
+  EXPECT_EQ(passes_.back().statusWord, 600u);
 }
 
 TEST_F(WorkersTest, DriveGoneFromAnotherThreadLeavesTheHandleToItsWorker) {
@@ -366,10 +242,9 @@ TEST_F(WorkersTest, DriveGoneFromAnotherThreadLeavesTheHandleToItsWorker) {
   machine->AddDrive(lights);
   Install(std::move(machine));
   int step = 0;
-  Run([&](const std::vector<Snapshot>& passes) {
+  Run([&](const std::vector<Pass>& passes) {
     if (step == 0) {
-      if (passes.back().rescans < 1 || machine_->PendingCount("lights", sim::Endpoint::Driver) < 1)
-        return false;
+      if (!Waiting(passes, "lights")) return false;
       machine_->SetCancelDelay("lights", sim::Endpoint::Driver, INFINITE);
       StateLock lock;
       StateBlock* block = monitorState.stateBlock;
@@ -391,7 +266,7 @@ TEST_F(WorkersTest, DriveGoneFromAnotherThreadLeavesTheHandleToItsWorker) {
     return true;
   });
   EXPECT_EQ(step, 1);
-  EXPECT_EQ(snapshots_.back().endedWorkers, 1u) << "only the lights worker ended on its own";
+  EXPECT_EQ(passes_.back().endedWorkers, 1u) << "only the lights worker ended on its own";
   EXPECT_EQ(machine_->OpenCount("lights", sim::Endpoint::Driver), 0u);
 }
 
@@ -399,11 +274,11 @@ TEST_F(WorkersTest, AStatusReadThatTheEnclosureNeverAnswersEndsOnItsTimeOutOrASt
   // The enclosure stops answering while the monitor reads its status page
   // with the mutex held. The read is given up after the device time-out, so
   // the passes go on; and a stop ends a read at once.
-  Install(DefaultMachine());
+  Install(Load());
   std::atomic<bool> monitorEnded{false};
   std::atomic<int> passesAfterAsk{-1};
   std::thread stopper;
-  Run([&](const std::vector<Snapshot>& passes) {
+  Run([&](const std::vector<Pass>& passes) {
     if (passesAfterAsk >= 0) passesAfterAsk += 1;
     if (stopper.joinable() || passes.back().rescans < 1) return false;
     machine_->HangIo("enclosure", sim::Endpoint::Enclosure, true);
