@@ -4,11 +4,9 @@
 #include <cstring>
 
 #include "pipe/pipe_server.h"
-#include "unit_monitor/monitor_setup.h"
 
-// The client's quality-of-service flags are the system's own values (the
-// emulation has no impersonation, so the values are checked where the system
-// headers define them).
+// The client's quality-of-service flags are the system's own values (checked
+// where the system headers define them).
 #if defined(SECURITY_SQOS_PRESENT)
 static_assert(kPipeClientSecurityFlags == (SECURITY_SQOS_PRESENT | SECURITY_IDENTIFICATION));
 #endif
@@ -16,27 +14,14 @@ static_assert(kPipeClientSecurityFlags == (SECURITY_SQOS_PRESENT | SECURITY_IDEN
 namespace pipetest {
 
 void MonitorFixture::SetUp() {
-  ASSERT_TRUE(OpenMonitorState());
+  ::MonitorFixture::SetUp();
   monitorState.pipeStopEvent = CreateEventW(nullptr, FALSE, FALSE, nullptr);
   ASSERT_NE(monitorState.pipeStopEvent, nullptr);
 }
 
 void MonitorFixture::TearDown() {
   if (monitorState.pipeStopEvent != nullptr) CloseHandle(monitorState.pipeStopEvent);
-  CloseMonitorState();
-}
-
-std::unique_ptr<StateBlock> MonitorFixture::Published() {
-  auto copy = std::make_unique<StateBlock>();
-  void* view = MapViewOfFile(monitorState.fileMapping, FILE_MAP_READ, 0, 0, kStateBlockSize);
-  EXPECT_NE(view, nullptr);
-  if (view != nullptr) {
-    WaitForSingleObject(monitorState.stateMutex, INFINITE);
-    std::memcpy(static_cast<void*>(copy.get()), view, kStateBlockSize);
-    ReleaseMutex(monitorState.stateMutex);
-    UnmapViewOfFile(view);
-  }
-  return copy;
+  ::MonitorFixture::TearDown();
 }
 
 void ServerFixture::SetUp() {

@@ -15,21 +15,19 @@
 #include "pipe/pipe_client.h"
 #include "platform/wide.h"
 #include "support/test_support.h"
+#include "unit_monitor/monitor_fixture.h"
 
 namespace pipetest {
 
 using skytest::Handle;
 using skytest::kGuardMs;
 
-// Monitor state with block, mutex, mapping and stop event (no server thread).
-class MonitorFixture : public ::testing::Test {
+// The monitor's state with the pipe stop event (no server thread).
+class MonitorFixture : public ::MonitorFixture {
  protected:
   void SetUp() override;
   void TearDown() override;
-
   StateBlock& Block() { return *monitorState.stateBlock; }
-  // A copy of the block as last published into the mapping.
-  std::unique_ptr<StateBlock> Published();
 };
 
 // The same with the pipe server thread running.

@@ -30,8 +30,8 @@ using pipetest::Send;
 
 class PipeServerTest : public pipetest::ServerFixture {
  protected:
-  DWORD PublishedStatus() { return Published()->statusWord; }
-  DWORD PublishedSequence() { return Published()->sequence; }
+  DWORD PublishedStatus() { return MappedCopy()->statusWord; }
+  DWORD PublishedSequence() { return MappedCopy()->sequence; }
   // The monitor's fields, read or written as the monitor does: under the mutex.
   template <typename F>
   DWORD Locked(F f) {
@@ -184,7 +184,7 @@ TEST_F(PipeServerTest, StopEndsTheThreadWithClientsConnectedAndTheMutexHeld) {
   Sleep(50);
   EXPECT_TRUE(StopServer());
   ReleaseMutex(monitorState.stateMutex);
-  EXPECT_NE(Published()->statusWord, 9u) << "the request ran after the stop";
+  EXPECT_NE(MappedCopy()->statusWord, 9u) << "the request ran after the stop";
   // The instances are gone: a connected client's read fails, the name is free.
   std::vector<BYTE> buffer(kCommandMaxLength);
   DWORD read = 0;
