@@ -45,34 +45,12 @@ TEST_F(MonitorLoop, WithoutDrivesPublishesEveryFifthTickAndStopsCleanly) {
   EXPECT_EQ(published_.back(), 500u);
 }
 
-TEST_F(MonitorLoop, PauseFreezesTheTickAndEndsAfterSixtyPassesWithARescan) {
-  Run([](const std::vector<Pass>& passes) {
-    if (passes.size() == 2) Set(&MonitorState::paused, 1);
-    if (passes.size() > 2 && passes.back().kind == PassKind::Regular &&
-        passes[passes.size() - 2].kind == PassKind::Paused) {
-      return true;
-    }
-    return passes.size() > 200;
-  });
-  const std::vector<Pass>& passes = passes_;
-  ASSERT_EQ(Count(passes, PassKind::Paused), 60u);
-  const DWORD frozen = passes[1].tick;
-  for (std::size_t i = 2; i < 62; ++i) {
-    EXPECT_EQ(passes[i].kind, PassKind::Paused);
-    EXPECT_EQ(passes[i].tick, frozen) << "the tick moved while paused";
-    EXPECT_EQ(passes[i].rescans, passes[1].rescans);
-  }
-  // The pause ended by itself with a refresh: the next regular tick rescans.
-  ASSERT_EQ(passes.size(), 63u);
-  EXPECT_EQ(passes[62].rescans, passes[1].rescans + 1);
-  EXPECT_EQ(monitorState.paused, 0u);
-}
-
 // One run through the requests that take passes of their own, each made
 // after the previous one settled: ten skipped ticks, a device change with a
 // stale list, a worker restart then a removal check, the tick's wrap from 3000
-// to 1, and a refresh.
-TEST_F(MonitorLoop, RequestsTakePassesOfTheirOwnAndTheTickWraps) {
+// to 1, a refresh, and a pause, which freezes the tick and ends by itself
+// after sixty passes with a refresh.
+TEST_F(MonitorLoop, PauseFreezesTheTickAndEndsAfterSixtyPassesWithARescan) {
   std::size_t publishesBefore = 0;
   Run([this, &publishesBefore](const std::vector<Pass>& passes) {
     switch (passes.size()) {
@@ -101,14 +79,15 @@ TEST_F(MonitorLoop, RequestsTakePassesOfTheirOwnAndTheTickWraps) {
         RequestRefresh();
         break;
     }
-    return passes.size() == 24;
+    if (passes.size() == 24) Set(&MonitorState::paused, 1);
+    return passes.size() == 85;
   });
   const std::vector<Pass>& passes = passes_;
-  ASSERT_EQ(passes.size(), 24u);
+  ASSERT_EQ(passes.size(), 85u);
   // S skipped, D device change, W workers restart, C removal check. The flags
   // become a refresh on a pass that does not sleep or advance the tick; one
   // refresh is one rescan on the next regular tick.
-  const std::string kinds = "RSSSSSSSSSSRDRRWCRRRRRRR";
+  const std::string kinds = "RSSSSSSSSSSRDRRWCRRRRRRR" + std::string(60, 'P') + "R";
   const DWORD ticks[] = {0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1, 1, 2, 3, 3, 3, 4, 5};
   const DWORD wrapped[] = {3000, 1, 2, 3, 4};
   const DWORD rescans[] = {0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1, 1, 1, 1, 2, 2, 2, 2, 2, 3, 3};
@@ -116,8 +95,10 @@ TEST_F(MonitorLoop, RequestsTakePassesOfTheirOwnAndTheTickWraps) {
   for (std::size_t i = 0; i < passes.size(); ++i) {
     SCOPED_TRACE(i);
     EXPECT_EQ(kinds[i], kindLetters[static_cast<std::size_t>(passes[i].kind)]);
-    EXPECT_EQ(passes[i].tick, i < 19 ? passes[0].tick + ticks[i] : wrapped[i - 19]);
-    EXPECT_EQ(passes[i].rescans, passes[0].rescans + rescans[i]);
+    EXPECT_EQ(passes[i].tick, i < 19   ? passes[0].tick + ticks[i]
+                              : i < 24 ? wrapped[i - 19]
+                                       : (i < 84 ? 4u : 5u));
+    EXPECT_EQ(passes[i].rescans, passes[0].rescans + (i < 24 ? rescans[i] : i < 84 ? 3 : 4));
   }
   // The refresh is published as 101, then 102 when its rescan ends.
   std::vector<DWORD> after(published_.begin() + static_cast<long>(publishesBefore),
@@ -126,6 +107,7 @@ TEST_F(MonitorLoop, RequestsTakePassesOfTheirOwnAndTheTickWraps) {
   EXPECT_EQ(after[0], 101u);
   EXPECT_EQ(after[1], 102u);
   EXPECT_EQ(after.back(), 500u);
+  EXPECT_EQ(monitorState.paused, 0u);
 }
 
 TEST_F(MonitorLoop, AProgramThatKeepsTheMutexCannotKeepTheStopFromEnding) {

@@ -1,7 +1,6 @@
-// Whether a call waits for a lock that the calling test holds: the call runs
-// on a thread of its own and must not return within 200 ms (real time, not
-// scaled); once the test gives the lock up it must return. A call that skips
-// the lock returns at once, so the check fails for it.
+// Whether a call waits for a lock that the calling test holds: run on a thread
+// of its own, it must not return within 200 ms (real time) and must return
+// once the lock is given up; a call that skips the lock fails the check.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -36,7 +35,7 @@ inline ::testing::AssertionResult WaitsForTheHeldLock(const std::function<void()
   return ::testing::AssertionFailure() << "returned while the lock was held";
 }
 
-// The same for the global state mutex, taken here.
+// The same for the state mutex, or one of the process's critical sections.
 inline ::testing::AssertionResult WaitsForTheStateMutex(const std::function<void()>& call) {
   if (WaitForSingleObject(monitorState.stateMutex, INFINITE) != WAIT_OBJECT_0) {
     return ::testing::AssertionFailure() << "cannot take the state mutex";
@@ -44,7 +43,6 @@ inline ::testing::AssertionResult WaitsForTheStateMutex(const std::function<void
   return WaitsForTheHeldLock(call, [] { ReleaseMutex(monitorState.stateMutex); });
 }
 
-// The same for one of the process's critical sections, entered here.
 inline ::testing::AssertionResult WaitsForTheSection(CRITICAL_SECTION* section,
                                                      const std::function<void()>& call) {
   EnterCriticalSection(section);

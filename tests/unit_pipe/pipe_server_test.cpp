@@ -146,16 +146,12 @@ TEST_F(PipeServerTest, FifteenInstancesServeAgainAfterClientsLeftEarly) {
     EXPECT_EQ(Send(clients.back().Get(), *NewCommand(kCommandSetStatus, 100u + DWORD(i))).Result(),
               1u);
   }
-  HANDLE extra =
-      CreateFileW(kPipeName, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr);
-  EXPECT_EQ(extra, INVALID_HANDLE_VALUE);
+  EXPECT_FALSE(Handle(
+      CreateFileW(kPipeName, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr)));
   EXPECT_EQ(GetLastError(), static_cast<DWORD>(ERROR_PIPE_BUSY));
-  if (extra != INVALID_HANDLE_VALUE) CloseHandle(extra);
-  HANDLE rogue = CreateNamedPipeW(kPipeName, PIPE_ACCESS_DUPLEX,
-                                  PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT,
-                                  kPipeInstanceCount, 4096, 4096, 0, nullptr);
-  EXPECT_EQ(rogue, INVALID_HANDLE_VALUE);
-  if (rogue != INVALID_HANDLE_VALUE) CloseHandle(rogue);
+  EXPECT_FALSE(Handle(CreateNamedPipeW(kPipeName, PIPE_ACCESS_DUPLEX,
+                                       PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT,
+                                       kPipeInstanceCount, 4096, 4096, 0, nullptr)));
 
   clients[7].Reset();
   Handle late(OpenCommandPipe(skytest::kGuardMs));
@@ -189,10 +185,8 @@ TEST_F(PipeServerTest, StopEndsTheThreadWithClientsConnectedAndTheMutexHeld) {
   std::vector<BYTE> buffer(kCommandMaxLength);
   DWORD read = 0;
   EXPECT_FALSE(ReadFile(idle.Get(), buffer.data(), kCommandMaxLength, &read, nullptr));
-  HANDLE after =
-      CreateFileW(kPipeName, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr);
-  EXPECT_EQ(after, INVALID_HANDLE_VALUE);
-  if (after != INVALID_HANDLE_VALUE) CloseHandle(after);
+  EXPECT_FALSE(Handle(
+      CreateFileW(kPipeName, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr)));
 }
 
 class PipeNameTakenTest : public pipetest::MonitorFixture {};
