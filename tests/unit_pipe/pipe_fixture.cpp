@@ -86,29 +86,6 @@ Exchange Send(HANDLE client, const CommandMessage& message) {
   return Send(client, &message, sizeof(message));
 }
 
-TestKey::TestKey() : path(Utf8ToWide("Software\\" + skytest::UniqueStem("reg"))) {
-  HKEY key = nullptr;
-  EXPECT_EQ(RegCreateKeyExW(HKEY_CURRENT_USER, path.c_str(), 0, nullptr, 0, KEY_ALL_ACCESS, nullptr,
-                            &key, nullptr),
-            ERROR_SUCCESS);
-  if (key != nullptr) RegCloseKey(key);
-}
-
-TestKey::~TestKey() {
-  RegDeleteKeyW(HKEY_CURRENT_USER, path.c_str());
-}
-
-bool TestKey::HasValue(const WCHAR* name) const {
-  HKEY key = nullptr;
-  if (RegOpenKeyExW(HKEY_CURRENT_USER, path.c_str(), 0, KEY_READ, &key) != ERROR_SUCCESS) {
-    return false;
-  }
-  DWORD size = 0;
-  const LSTATUS status = RegQueryValueExW(key, name, nullptr, nullptr, nullptr, &size);
-  RegCloseKey(key);
-  return status == ERROR_SUCCESS;
-}
-
 std::unique_ptr<CommandMessage> NewCommand(DWORD command, DWORD arg1, DWORD arg2, DWORD arg3) {
   auto message = std::make_unique<CommandMessage>();
   InitCommand(message.get(), command, arg1, arg2, arg3);

@@ -60,17 +60,6 @@ struct Exchange {
 Exchange Send(HANDLE client, const void* request, DWORD sent);
 Exchange Send(HANDLE client, const CommandMessage& message);
 
-// A key of the case's own below HKEY_CURRENT_USER\Software, removed again at
-// the end of the case.
-struct TestKey {
-  TestKey();
-  ~TestKey();
-  TestKey(const TestKey&) = delete;
-  TestKey& operator=(const TestKey&) = delete;
-  bool HasValue(const WCHAR* name) const;
-  WideString path;
-};
-
 // A fresh full-length request on the heap.
 std::unique_ptr<CommandMessage> NewCommand(DWORD command, DWORD arg1 = 0, DWORD arg2 = 0,
                                            DWORD arg3 = 0);

@@ -23,6 +23,15 @@ using pipetest::NewCommand;
 // A key of this case's own below HKEY_CURRENT_USER\Software, removed at the end.
 class RegistryRequestTest : public pipetest::MonitorFixture {
  protected:
+  RegistryRequestTest() {
+    HKEY key = nullptr;
+    EXPECT_EQ(RegCreateKeyExW(HKEY_CURRENT_USER, path_.c_str(), 0, nullptr, 0, KEY_ALL_ACCESS,
+                              nullptr, &key, nullptr),
+              ERROR_SUCCESS);
+    if (key != nullptr) RegCloseKey(key);
+  }
+  ~RegistryRequestTest() override { RegDeleteKeyW(HKEY_CURRENT_USER, path_.c_str()); }
+
   // A full-length command 13 message for this case's key.
   std::unique_ptr<CommandMessage> Request(const char* name, DWORD operation, DWORD type,
                                           const void* data, DWORD dataLength) {
@@ -43,21 +52,24 @@ class RegistryRequestTest : public pipetest::MonitorFixture {
   std::vector<BYTE> ReadValue(const char* name, DWORD* type) {
     std::vector<BYTE> data(2048);
     DWORD size = static_cast<DWORD>(data.size());
-    *type = 0xFFFF;
     HKEY key = nullptr;
-    if (RegOpenKeyExW(HKEY_CURRENT_USER, path_.c_str(), 0, KEY_READ, &key) == ERROR_SUCCESS) {
-      if (RegQueryValueExW(key, Utf8ToWide(name).c_str(), nullptr, type, data.data(), &size) !=
-          ERROR_SUCCESS) {
-        size = 0;
-      }
+    LSTATUS status = RegOpenKeyExW(HKEY_CURRENT_USER, path_.c_str(), 0, KEY_READ, &key);
+    if (status == ERROR_SUCCESS) {
+      status = RegQueryValueExW(key, Utf8ToWide(name).c_str(), nullptr, type, data.data(), &size);
       RegCloseKey(key);
     }
-    data.resize(size);
+    if (status != ERROR_SUCCESS) *type = 0xFFFF;
+    data.resize(status == ERROR_SUCCESS ? size : 0);
     return data;
   }
 
-  pipetest::TestKey key_;
-  const WideString& path_ = key_.path;
+  bool HasValue(const char* name) {
+    DWORD type = 0;
+    ReadValue(name, &type);
+    return type != 0xFFFF;
+  }
+
+  const WideString path_ = Utf8ToWide("Software\\" + skytest::UniqueStem("reg"));
 };
 
 std::vector<BYTE> Pattern(std::size_t size) {
@@ -93,7 +105,7 @@ TEST_F(RegistryRequestTest, OutcomesOfSetQueryAndOtherOperations) {
 
   // Any other operation only opens the key.
   EXPECT_EQ(Run(Request("Untouched", 2, REG_BINARY, data.data(), 8).get()), ERROR_SUCCESS);
-  EXPECT_FALSE(key_.HasValue(WSTR("Untouched")));
+  EXPECT_FALSE(HasValue("Untouched"));
 }
 
 TEST_F(RegistryRequestTest, RootKeyMustBePredefined) {
@@ -118,7 +130,7 @@ TEST_F(RegistryRequestTest, RootKeyMustBePredefined) {
     EXPECT_EQ(Run(request.get()), static_cast<DWORD>(ERROR_INVALID_PARAMETER)) << std::hex << root;
   }
   RegCloseKey(own);
-  EXPECT_FALSE(key_.HasValue(WSTR("Refused")));
+  EXPECT_FALSE(HasValue("Refused"));
 
   // Each root as a 64-bit client sends it and in the zero-extended 32-bit
   // form a 32-bit client sends.
@@ -134,7 +146,7 @@ TEST_F(RegistryRequestTest, RootKeyMustBePredefined) {
   auto set = Request("Narrow", kRegistrySet, REG_BINARY, data.data(), 4);
   set->registry.rootKey = RootKeyValue(HKEY_CURRENT_USER) & 0xFFFFFFFFu;
   EXPECT_EQ(Run(set.get()), ERROR_SUCCESS);
-  EXPECT_TRUE(key_.HasValue(WSTR("Narrow"))) << "the 32-bit form reached another key";
+  EXPECT_TRUE(HasValue("Narrow")) << "the 32-bit form reached another key";
 }
 
 // Offsets and lengths against the bytes delivered: each case is laid out in a
@@ -181,7 +193,7 @@ TEST_F(RegistryRequestTest, TextsAndDataMustLieInsideTheBytesDelivered) {
     EXPECT_EQ(Run(request.get(), c.available), static_cast<DWORD>(ERROR_INVALID_PARAMETER))
         << c.what;
   }
-  EXPECT_FALSE(key_.HasValue(WSTR("Edge")));
+  EXPECT_FALSE(HasValue("Edge"));
 
   // Exactly enough bytes: the data area ends on the last byte delivered.
   EXPECT_EQ(Run(base.get(), dataEnd), ERROR_SUCCESS);
@@ -225,12 +237,12 @@ TEST_F(RegistryDispatchTest, BytesNotDeliveredOrBeyondTheDeclaredLengthAreRefuse
   // The data's last byte did not arrive, although the message declares it.
   EXPECT_EQ(dispatch(static_cast<DWORD>(dataEnd - 1), kCommandMaxLength),
             static_cast<DWORD>(ERROR_INVALID_PARAMETER));
-  EXPECT_FALSE(key_.HasValue(WSTR("Cut")));
+  EXPECT_FALSE(HasValue("Cut"));
   // It arrived, though beyond the length the message declares: what arrived
   // bounds the request.
   if (dataEnd > kCommandMinLength) {
     EXPECT_EQ(dispatch(kCommandMaxLength, dataEnd - 1), ERROR_SUCCESS);
-    EXPECT_TRUE(key_.HasValue(WSTR("Cut")));
+    EXPECT_TRUE(HasValue("Cut"));
   }
   EXPECT_EQ(dispatch(static_cast<DWORD>(dataEnd), kCommandMaxLength), ERROR_SUCCESS);
   DWORD type = 0;
