@@ -157,29 +157,29 @@ TEST_F(MonitorLoop, ExistingSharedObjectsAreUsedAndOutliveTheService) {
   CloseHandle(mutex);
 }
 
-TEST_F(MonitorLoop, FailedStartUpTearsDownWithoutRunningTheLoop) {
-  // An event already holds the mapping's name, so the mapping cannot be made.
-  HANDLE squatter = CreateEventW(nullptr, TRUE, FALSE, kFileMapName);
-  ASSERT_NE(squatter, nullptr);
-  const long handles = platform::LiveHandleCount();
-  Run([](const std::vector<Pass>&) { return true; });
-  EXPECT_TRUE(passes_.empty());
-  EXPECT_TRUE(published_.empty());
-  EXPECT_EQ(platform::LiveHandleCount(), handles);
-  CloseHandle(squatter);
-}
-
-TEST_F(MonitorLoop, StopAskedForBeforeTheRunEndsItAtOnceAndReachesTheApplication) {
+// A stop asked for before the run ends it at once and reaches the application;
+// it is used up, so the next run goes on until stopped. A start-up that fails
+// tears down what it made without running the loop.
+TEST_F(MonitorLoop, EarlyStopOrFailedStartUpEndsTheRunBeforeItsFirstPass) {
   skytest::Handle uiStop(CreateEventW(nullptr, FALSE, FALSE, kUiStopEventName));
   ASSERT_TRUE(uiStop);
   StopMonitor();  // before RunMonitor created any of its events
   Run([](const std::vector<Pass>&) { return true; });
   EXPECT_TRUE(passes_.empty()) << "the early stop was lost";
   EXPECT_EQ(WaitForSingleObject(uiStop.Get(), 0), WAIT_OBJECT_0);
-  // The stop was used up by that run: the next one runs until stopped.
-  passes_.clear();
   Run([](const std::vector<Pass>& passes) { return passes.size() == 2; });
   EXPECT_EQ(passes_.size(), 2u);
+
+  // An event already holds the mapping's name, so the mapping cannot be made.
+  skytest::Handle squatter(CreateEventW(nullptr, TRUE, FALSE, kFileMapName));
+  ASSERT_TRUE(squatter);
+  passes_.clear();
+  published_.clear();
+  const long handles = platform::LiveHandleCount();
+  Run([](const std::vector<Pass>&) { return true; });
+  EXPECT_TRUE(passes_.empty());
+  EXPECT_TRUE(published_.empty());
+  EXPECT_EQ(platform::LiveHandleCount(), handles);
 }
 
 TEST_F(MonitorLoop, PlantedSmallMappingIsReportedOnceAndReplacedWhenFreed) {
@@ -297,39 +297,31 @@ TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
   // list; its record keeps the index 0 of another drive's copy.
   const std::uint8_t notPublishable[4] = {0x4A, 0x00, 0x00, 0x00};
   machine_->SetStatus("firewire", notPublishable);
-  struct Seen {
-    LONG publishedCount = 0;
-    std::vector<DWORD> copyCode;
-    std::vector<DWORD> ownCode;
-    std::vector<LONG> copyLevel;
-    std::vector<LONG> ownLevel;
-  };
-  std::vector<Seen> seen;
-  Run([&seen](const std::vector<Pass>& passes) {
-    Seen now;
-    {
-      StateLock lock;
-      const StateBlock* block = monitorState.stateBlock;
-      now.publishedCount = block->publishedCount;
-      for (LONG p = 0; p < block->publishedCount; ++p) {
-        now.copyCode.push_back(block->published[p].statusCode);
-        now.ownCode.push_back(block->drives[block->published[p].recordIndex].statusCode);
-        now.copyLevel.push_back(block->published[p].statusLevel);
-        now.ownLevel.push_back(block->drives[block->published[p].recordIndex].statusLevel);
-      }
+  // Per pass, each published drive's copy and own record as "code/level".
+  std::vector<std::vector<std::string>> copies, records;
+  Run([&](const std::vector<Pass>& passes) {
+    StateLock lock;
+    const StateBlock* block = monitorState.stateBlock;
+    copies.emplace_back();
+    records.emplace_back();
+    for (LONG p = 0; p < block->publishedCount; ++p) {
+      const DriveRecord& copy = block->published[p];
+      const DriveRecord& own = block->drives[copy.recordIndex];
+      EXPECT_NE(copy.statusCode, 4u) << "pass " << passes.size();
+      copies.back().push_back(std::to_string(copy.statusCode) + "/" +
+                              std::to_string(copy.statusLevel));
+      records.back().push_back(std::to_string(own.statusCode) + "/" +
+                               std::to_string(own.statusLevel));
     }
-    seen.push_back(now);
     return passes.size() == 12;
   });
-  ASSERT_EQ(seen.size(), 12u);
-  ASSERT_GE(seen.back().publishedCount, 1);
-  for (std::size_t i = 0; i < seen.size(); ++i) {
-    EXPECT_EQ(seen[i].copyCode, seen[i].ownCode) << "pass " << i;
-    EXPECT_EQ(seen[i].copyLevel, seen[i].ownLevel) << "pass " << i;
-    for (DWORD code : seen[i].copyCode) EXPECT_NE(code, 4u) << "pass " << i;
-  }
+  ASSERT_EQ(copies.size(), 12u);
+  ASSERT_FALSE(copies.back().empty());
+  EXPECT_EQ(copies, records);
   // Every published drive answered its status page: a level of 0 to 3.
-  for (LONG level : seen.back().copyLevel) EXPECT_TRUE(level >= 0 && level <= 3) << level;
+  for (const std::string& drive : copies.back()) {
+    EXPECT_TRUE(drive.size() == 3 && drive[2] >= '0' && drive[2] <= '3') << drive;
+  }
 }
 
 }  // namespace
