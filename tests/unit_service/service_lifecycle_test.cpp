@@ -1,6 +1,6 @@
 // The service main function under the emulated service control manager.
-#include <condition_variable>
-#include <mutex>
+#include <atomic>
+#include <chrono>
 #include <thread>
 
 #include "monitor/monitor_state.h"
@@ -14,23 +14,12 @@ namespace {
 
 using servicetest::States;
 
-// Follows the monitor's completed rescans through its pass hook.
-struct RescanProbe {
-  std::mutex lock;
-  std::condition_variable changed;
-  DWORD rescans = 0;
-};
-RescanProbe probe;
+// The monitor's completed rescans, followed through its pass hook.
+std::atomic<DWORD> rescans{0};
 
 void CountRescans(PassKind) {
-  DWORD rescans;
-  {
-    StateLock lock;
-    rescans = monitorState.rescanCount;
-  }
-  std::lock_guard<std::mutex> guard(probe.lock);
-  probe.rescans = rescans;
-  probe.changed.notify_all();
+  StateLock lock;
+  rescans = monitorState.rescanCount;
 }
 
 class ServiceLifecycle : public ::testing::Test {
@@ -41,8 +30,7 @@ class ServiceLifecycle : public ::testing::Test {
     emu::BeginServiceSession();
     emu::ClearEventLog();
     monitorHooks.afterPass = CountRescans;
-    std::lock_guard<std::mutex> guard(probe.lock);
-    probe.rescans = 0;
+    rescans = 0;
   }
   void TearDown() override {
     if (entry_.joinable()) {
@@ -59,10 +47,12 @@ class ServiceLifecycle : public ::testing::Test {
     ASSERT_TRUE(emu::WaitForDispatcherReturn());
     entry_.join();
   }
-  bool WaitForRescans(DWORD count) {
-    std::unique_lock<std::mutex> guard(probe.lock);
-    return probe.changed.wait_for(guard, std::chrono::seconds(30),
-                                  [&] { return probe.rescans >= count; });
+  static bool WaitForRescans(DWORD count) {
+    // Real time: the emulation's Sleep is scaled.
+    for (int i = 0; i < 3000 && rescans < count; ++i) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return rescans >= count;
   }
   std::thread entry_;
 };
@@ -112,10 +102,7 @@ TEST_F(ServiceLifecycle, NullEighthRegistrationRemovesTheSevenAndSkipsTheMonitor
   const std::vector<DWORD> expected = {SERVICE_START_PENDING, SERVICE_START_PENDING,
                                        SERVICE_STOPPED};
   EXPECT_EQ(States(reports), expected);
-  {
-    std::lock_guard<std::mutex> guard(probe.lock);
-    EXPECT_EQ(probe.rescans, 0u);
-  }
+  EXPECT_EQ(rescans, 0u);
   EXPECT_EQ(emu::LiveDeviceNotificationCount(), 0u);
   EXPECT_EQ(notificationTable.count, 0);
   for (HDEVNOTIFY handle : notificationTable.handles) EXPECT_EQ(handle, nullptr);
@@ -141,12 +128,8 @@ TEST_F(ServiceLifecycle, DeviceEventReachesTheMonitorAndReReportsTheState) {
   StartService();
   ASSERT_TRUE(emu::WaitForServiceState(SERVICE_RUNNING));
   ASSERT_TRUE(WaitForRescans(1));
-  DWORD rescans;
-  {
-    std::lock_guard<std::mutex> guard(probe.lock);
-    rescans = probe.rescans;
-  }
-  const std::size_t before = emu::ServiceStatusReports().size();
+  const DWORD before = rescans;
+  const std::size_t reported = emu::ServiceStatusReports().size();
   DEV_BROADCAST_DEVICEINTERFACE_W record = {};
   record.dbcc_size = sizeof(record);
   record.dbcc_devicetype = DBT_DEVTYP_DEVICEINTERFACE;
@@ -154,11 +137,11 @@ TEST_F(ServiceLifecycle, DeviceEventReachesTheMonitorAndReReportsTheState) {
   const emu::DeviceEventOutcome outcome = emu::DeliverDeviceEvent(DBT_DEVICEARRIVAL, &record);
   EXPECT_EQ(outcome.recipients, 1);
   // A disk arrival requests a refresh: the loop runs one more full rescan.
-  EXPECT_TRUE(WaitForRescans(rescans + 1));
+  EXPECT_TRUE(WaitForRescans(before + 1));
   const std::vector<SERVICE_STATUS> reports = emu::ServiceStatusReports();
-  ASSERT_GT(reports.size(), before);
-  EXPECT_EQ(reports[before].dwCurrentState, static_cast<DWORD>(SERVICE_RUNNING));
-  EXPECT_EQ(reports[before].dwCheckPoint, 0u);
+  ASSERT_GT(reports.size(), reported);
+  EXPECT_EQ(reports[reported].dwCurrentState, static_cast<DWORD>(SERVICE_RUNNING));
+  EXPECT_EQ(reports[reported].dwCheckPoint, 0u);
 }
 
 }  // namespace
