@@ -7,8 +7,8 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <chrono>
-#include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
 #include <functional>
@@ -83,27 +83,23 @@ class MonitorRun : public ::testing::Test {
     script_ = std::move(script);
     monitor_ = std::thread([this] {
       RunMonitor(0, nullptr);
-      std::lock_guard<std::mutex> guard(lock_);
       finished_ = true;
-      changed_.notify_all();
     });
   }
   // Waits for RunMonitor to return; a monitor that never stops ends the
   // program, since its thread cannot be joined.
   void Finish() {
-    std::unique_lock<std::mutex> guard(lock_);
-    if (!changed_.wait_for(guard, std::chrono::seconds(60), [this] { return finished_; })) {
+    if (!WaitUntil([this] { return finished_.load(); }, 60)) {
       std::fprintf(stderr, "the monitor did not stop\n");
       std::abort();
     }
-    guard.unlock();
     monitor_.join();
     finished_ = false;
     EXPECT_LT(passes_.size(), kMaxPasses) << "the run did not reach its goal";
   }
   // Waits (real time, guarded) until `done` holds.
-  static bool WaitUntil(const std::function<bool()>& done) {
-    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  static bool WaitUntil(const std::function<bool()>& done, int seconds = 20) {
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(seconds);
     while (!done()) {
       if (std::chrono::steady_clock::now() > deadline) return false;
       std::this_thread::sleep_for(std::chrono::milliseconds(2));
@@ -184,8 +180,7 @@ class MonitorRun : public ::testing::Test {
   }
 
   static inline MonitorRun* active = nullptr;
-  std::condition_variable changed_;
-  bool finished_ = false;
+  std::atomic<bool> finished_{false};
   Script script_;
   std::thread monitor_;
 };

@@ -35,14 +35,14 @@ class WorkersTest : public monitorrun::MonitorRun {
 
 // Only drives of channel models: a button-filter-driver drive and an
 // enclosure, both IEEE 1394.
-std::unique_ptr<sim::Machine> CountedMachine() {
+std::unique_ptr<sim::Machine> CountedMachine(const std::string& more = "") {
   std::string text(sim::DefaultMachineText());
   const std::size_t gauge = text.find("# USB drive of a standalone gauge model");
   const std::size_t fireWire = text.find("# IEEE 1394 drive reached through");
   EXPECT_NE(gauge, std::string::npos);
   EXPECT_NE(fireWire, std::string::npos);
   text.erase(gauge, fireWire - gauge);
-  return monitorrun::MonitorRun::Load(text);
+  return monitorrun::MonitorRun::Load(text + more);
 }
 
 // Settled, then a panel event: the plain drive is not of a channel model, so
@@ -227,20 +227,17 @@ TEST_F(WorkersTest, DriveGoneFromAnotherThreadLeavesTheHandleToItsWorker) {
   // A driver channel in gauge mode ends with the drive-gone command. Its
   // worker is blocked in a read on a device that never completes a cancel:
   // only the worker can give that read up, so it must be the one to close.
-  std::unique_ptr<sim::Machine> machine = CountedMachine();
-  sim::DriveSpec lights;
-  lights.name = "lights";
-  lights.bus = sim::Bus::Ieee1394;
-  lights.channel = sim::ChannelKind::Driver;
-  lights.modelCode = "5E22";
-  lights.unitModel = "EXTERNAL_LIGHTS";
-  lights.unitId = "0030E0000002C4D5";
-  lights.serial = "QX-02C4D5";
-  sim::VolumeSpec volume;
-  volume.letter = 'J';
-  lights.volumes.push_back(volume);
-  machine->AddDrive(lights);
-  Install(std::move(machine));
+  Install(CountedMachine(R"(
+drive lights
+  bus 1394
+  channel driver
+  model-code 5E22
+  unit-model EXTERNAL_LIGHTS
+  unit-id 0030E0000002C4D5
+  serial QX-02C4D5
+  volume J fixed 100G 50G
+end
+)"));
   int step = 0;
   Run([&](const std::vector<Pass>& passes) {
     if (step == 0) {
