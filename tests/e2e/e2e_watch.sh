@@ -30,10 +30,10 @@ press_until() {
 }
 # The drive rows only (the part between "Drives" and "Channels").
 drive_rows() { screen | sed -n '/^Drives/,/^Channels/p'; }
-sim() { "$CLIENT" sim "$@" >"$WORK/sim.txt" 2>&1 || fail "sim $* exited $?"; }
+sim() { client sim "$@" >"$WORK/sim.txt" 2>&1 || fail "sim $* exited $?"; }
 # A refused request: exit 2, one line on stderr, nothing on stdout.
 refused() {
-  "$CLIENT" sim "$@" >"$WORK/out.txt" 2>"$WORK/err.txt"
+  client sim "$@" >"$WORK/out.txt" 2>"$WORK/err.txt"
   rc=$?
   [ $rc = 2 ] || fail "sim $*: exit $rc, wanted 2"
   [ "$(wc -l <"$WORK/err.txt")" = 1 ] || fail "sim $*: not one line on stderr"
@@ -83,7 +83,8 @@ sim add "$WORK/spare.txt"
 shows "arrived \(J:\)" "added drive"
 
 # Bad input changes nothing and says why in one line.
-"$CLIENT" sim list --json >"$WORK/before.txt" 2>&1 || fail "sim list --json"
+printf 'drive x\n  bus usb\n  nonsense key\nend\n' >"$WORK/bad.txt"
+client sim list --json >"$WORK/before.txt" 2>&1 || fail "sim list --json"
 grep -q '"name": "gauge"' "$WORK/before.txt" || fail "list --json has no gauge drive"
 while read -r args; do
   # shellcheck disable=SC2086 # the row is the argument list
@@ -106,14 +107,13 @@ unplug firewire
 hold 1
 add $WORK/absent.txt
 add $WORK/spare.txt
+add $WORK/bad.txt
 ROWS
-printf 'drive x\n  bus usb\n  nonsense key\nend\n' >"$WORK/bad.txt"
-refused add "$WORK/bad.txt"
-"$CLIENT" sim list --json >"$WORK/after.txt" 2>&1 || fail "sim list --json after"
+client sim list --json >"$WORK/after.txt" 2>&1 || fail "sim list --json after"
 cmp -s "$WORK/before.txt" "$WORK/after.txt" || fail "bad input changed the machine"
 
 # Without a terminal: plain text, no escape codes.
-"$CLIENT" watch --once >"$WORK/plain.txt" 2>&1 || fail "watch --once"
+client watch --once >"$WORK/plain.txt" 2>&1 || fail "watch --once"
 grep -q "status word" "$WORK/plain.txt" || fail "watch --once printed no view"
 grep -q "$(printf '\033')" "$WORK/plain.txt" && fail "escape codes in plain output"
 
