@@ -12,7 +12,7 @@ case $1 in
   wine) RUN=wine ;;
   *) echo "unknown mode $1" >&2 && exit 2 ;;
 esac
-. "$(dirname "$0")/../e2e/e2e_lib.sh"
+. "$(dirname "$0")/e2e_lib.sh"
 if [ "$RUN" = wine ]; then
   export WINEDEBUG=-all
   export WINEDLLOVERRIDES="mscoree,mshtml="
