@@ -1,5 +1,3 @@
-#include "drive_fuzz_entry.h"
-
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
@@ -29,7 +27,7 @@ constexpr std::uint32_t kDriveCommands[] = {kCommandSafeRemove,       kCommandRe
                                             kCommandReleaseDriveAlso, kCommandRefreshGauges,
                                             kCommandReadStatus,       kCommandWriteControl};
 
-fuzzsupport::RecordingModel* computer = nullptr;
+fuzzsupport::RecordingComputer* computer = nullptr;
 StateBlock* block = nullptr;
 StateBlock* snapshot = nullptr;
 HANDLE channelHandles[kMaxChannels] = {};
@@ -127,8 +125,7 @@ void SetUpOnce() {
   machine->SetDeviceEventSink([](DWORD, const void*) {});
   driveNames = DriveNames(sim::DefaultMachineText());
   Check(!driveNames.empty(), "the default machine names its drives");
-  computer = new fuzzsupport::RecordingModel(std::move(machine));
-  emu::SetDeviceModel(computer);
+  computer = new fuzzsupport::RecordingComputer(std::move(machine));
   InitializeProcessLocks();
   block = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));
   snapshot = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));

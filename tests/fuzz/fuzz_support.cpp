@@ -103,20 +103,26 @@ void KeepRegistrySmall() {
   if (!ignored && size > 4096) std::filesystem::remove(store, ignored);
 }
 
-std::vector<std::u16string> RecordingModel::TakeOpened() {
+RecordingComputer::RecordingComputer(std::unique_ptr<sim::Machine> machine)
+    : machine_(std::move(machine)) {
+  machine_->Install();  // answers every device call but opens, which come here
+  emu::SetDeviceProvider(this);
+}
+
+std::vector<std::u16string> RecordingComputer::TakeOpened() {
   std::lock_guard<std::mutex> lock(mutex_);
   std::vector<std::u16string> taken;
   taken.swap(opened_);
   return taken;
 }
 
-std::unique_ptr<emu::DeviceFile> RecordingModel::Open(const WCHAR* path, DWORD access, DWORD share,
-                                                      DWORD flags, DWORD* error) {
+std::unique_ptr<emu::DeviceFile> RecordingComputer::Open(const WCHAR* path, DWORD access,
+                                                         DWORD share, DWORD flags, DWORD* error) {
   {
     std::lock_guard<std::mutex> lock(mutex_);
     opened_.emplace_back(path);
   }
-  return inner_->Open(path, access, share, flags, error);
+  return machine_->Open(path, access, share, flags, error);
 }
 
 void CheckReply(const std::uint8_t* original, std::size_t received, const std::uint8_t* reply,

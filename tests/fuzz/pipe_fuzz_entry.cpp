@@ -1,5 +1,3 @@
-#include "pipe_fuzz_entry.h"
-
 #include <cstdlib>
 #include <cstring>
 #include <memory>
@@ -16,7 +14,7 @@ namespace {
 
 using fuzzsupport::Check;
 
-fuzzsupport::RecordingModel* computer = nullptr;
+fuzzsupport::RecordingComputer* computer = nullptr;
 
 // The surroundings the monitor gives the dispatcher, made once, on a computer
 // without drives: nothing a request names may ever be opened.
@@ -25,8 +23,7 @@ void SetUpOnce() {
   if (done) return;
   done = true;
   fuzzsupport::UsePrivateEmulation("pipefuzz");
-  computer = new fuzzsupport::RecordingModel(std::make_unique<sim::Machine>());
-  emu::SetDeviceModel(computer);
+  computer = new fuzzsupport::RecordingComputer(std::make_unique<sim::Machine>());
   InitializeProcessLocks();
   static StateBlock* block = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));
   monitorState = MonitorState{};
