@@ -1,8 +1,7 @@
 // Named kernel objects under "Global\": the pagefile-backed mapping, the
 // mutex and the events that the service shares with the user-interface
 // process. Creating an existing name opens the same object
-// (ERROR_ALREADY_EXISTS), another process sees it, and it lives as long as
-// any handle does.
+// (ERROR_ALREADY_EXISTS) and another process sees it.
 #include <gtest/gtest.h>
 
 #include <cstring>
@@ -146,36 +145,6 @@ TEST(NamedObjects, MappingCreatedByOneProcessIsReadByAnother) {
   view.Bytes()[kBlockBytes - 1] = 0x5A;
   ASSERT_EQ(skytest::RunChildSelf("reader", skytest::kProcessGuardMs), 0);
   EXPECT_EQ(std::memcmp(view.Bytes() + 1000, "seen", 4), 0);
-}
-
-TEST(NamedObjects, MappingLivesAsLongAsAnyHandleAndThenGoes) {
-  WideString name = GlobalName("map");
-  Handle creator = CreateBlockMapping(name);
-  ASSERT_TRUE(creator);
-  {
-    View view(creator.Get(), FILE_MAP_ALL_ACCESS);
-    ASSERT_TRUE(view);
-    view.Bytes()[kBlockBytes - 4] = 0x77;
-  }
-  Handle reader(OpenFileMappingW(FILE_MAP_READ, FALSE, name.c_str()));
-  ASSERT_TRUE(reader);
-  creator.Reset();  // the creator is gone; the reader still holds the block
-  {
-    Handle again(OpenFileMappingW(FILE_MAP_READ, FALSE, name.c_str()));
-    ASSERT_TRUE(again);
-    View view(again.Get(), FILE_MAP_READ);
-    ASSERT_TRUE(view);
-    EXPECT_EQ(view.Bytes()[kBlockBytes - 4], 0x77);
-  }
-  reader.Reset();
-  // With the last handle closed the name is free and a new block starts zeroed.
-  SetLastError(ERROR_INVALID_DATA);
-  Handle fresh = CreateBlockMapping(name);
-  ASSERT_TRUE(fresh);
-  EXPECT_EQ(GetLastError(), ERROR_SUCCESS);
-  View view(fresh.Get(), FILE_MAP_READ);
-  ASSERT_TRUE(view);
-  EXPECT_EQ(view.Bytes()[kBlockBytes - 4], 0);
 }
 
 TEST(NamedObjects, MutexAndEventsWorkAcrossProcessesAndAbandonOnExit) {
