@@ -190,36 +190,32 @@ TEST(Mutex, OwnerThreadEndingAbandonsItToTheNextWaiter) {
 }
 
 TEST(Threads, HandleIsSignalledWhenTheThreadEndsWithItsExitCodeAndOwnLastError) {
-  for (bool useExitThread : {false, true}) {
-    SCOPED_TRACE(useExitThread ? "ExitThread" : "return");
-    Handle go = NewEvent(true, false);
-    ASSERT_TRUE(go);
-    DWORD seenId = 0;
-    DWORD seenError = 0;
-    Thread thread([&]() -> DWORD {
-      seenId = GetCurrentThreadId();
-      if (WaitForSingleObject(go.Get(), kGuardMs) != WAIT_OBJECT_0) return 1;
-      SetLastError(ERROR_BROKEN_PIPE);
-      seenError = GetLastError();
-      if (useExitThread) ExitThread(7);
-      return 42;
-    });
-    EXPECT_NE(thread.Id(), 0u);
-    EXPECT_NE(thread.Id(), GetCurrentThreadId());
-    EXPECT_EQ(WaitForSingleObject(thread.Get(), 0), WAIT_TIMEOUT);
-    DWORD code = 0;
-    ASSERT_TRUE(GetExitCodeThread(thread.Get(), &code));
-    EXPECT_EQ(code, STILL_ACTIVE);
-    // The last error is per thread; successful SetEvent and waits leave it alone.
-    SetLastError(ERROR_OPERATION_ABORTED);
-    ASSERT_TRUE(SetEvent(go.Get()));
-    ASSERT_EQ(WaitForSingleObject(thread.Get(), kGuardMs), WAIT_OBJECT_0);
-    EXPECT_EQ(GetLastError(), ERROR_OPERATION_ABORTED);
-    EXPECT_EQ(seenError, ERROR_BROKEN_PIPE);
-    EXPECT_EQ(thread.Join(), useExitThread ? 7u : 42u);
-    EXPECT_EQ(WaitForSingleObject(thread.Get(), 0), WAIT_OBJECT_0);  // stays signalled
-    EXPECT_EQ(seenId, thread.Id());
-  }
+  Handle go = NewEvent(true, false);
+  ASSERT_TRUE(go);
+  DWORD seenId = 0;
+  DWORD seenError = 0;
+  Thread thread([&]() -> DWORD {
+    seenId = GetCurrentThreadId();
+    if (WaitForSingleObject(go.Get(), kGuardMs) != WAIT_OBJECT_0) return 1;
+    SetLastError(ERROR_BROKEN_PIPE);
+    seenError = GetLastError();
+    return 42;
+  });
+  EXPECT_NE(thread.Id(), 0u);
+  EXPECT_NE(thread.Id(), GetCurrentThreadId());
+  EXPECT_EQ(WaitForSingleObject(thread.Get(), 0), WAIT_TIMEOUT);
+  DWORD code = 0;
+  ASSERT_TRUE(GetExitCodeThread(thread.Get(), &code));
+  EXPECT_EQ(code, STILL_ACTIVE);
+  // The last error is per thread; successful SetEvent and waits leave it alone.
+  SetLastError(ERROR_OPERATION_ABORTED);
+  ASSERT_TRUE(SetEvent(go.Get()));
+  ASSERT_EQ(WaitForSingleObject(thread.Get(), kGuardMs), WAIT_OBJECT_0);
+  EXPECT_EQ(GetLastError(), ERROR_OPERATION_ABORTED);
+  EXPECT_EQ(seenError, ERROR_BROKEN_PIPE);
+  EXPECT_EQ(thread.Join(), 42u);
+  EXPECT_EQ(WaitForSingleObject(thread.Get(), 0), WAIT_OBJECT_0);  // stays signalled
+  EXPECT_EQ(seenId, thread.Id());
 }
 
 // Two threads count under a mutex (half of the takes through a wait-all with
