@@ -66,14 +66,12 @@ std::atomic<bool> chaosRunning{false};
 std::atomic<long> exchanges{0};
 
 // The first published drive's record, for commands 11 and 12.
-bool FirstPublishedDrive(HANDLE mapping, BYTE* image) {
-  void* view = MapViewOfFile(mapping, FILE_MAP_READ, 0, 0, kStateBlockSize);
-  if (view == nullptr) return false;
-  const auto* block = static_cast<const StateBlock*>(view);
-  const bool found = block->publishedCount > 0;
-  if (found) std::memcpy(image, &block->published[0], kDriveImageSize);
-  UnmapViewOfFile(view);
-  return found;
+void FirstPublishedDrive(HANDLE mapping, BYTE* image) {
+  const auto* block =
+      static_cast<const StateBlock*>(MapViewOfFile(mapping, FILE_MAP_READ, 0, 0, kStateBlockSize));
+  if (block == nullptr) return;
+  if (block->publishedCount > 0) std::memcpy(image, &block->published[0], kDriveImageSize);
+  UnmapViewOfFile(block);
 }
 
 // Streams commands 1, 2, 6 (suspend, resume), 7/8, 9, 11, 12 and 13.
@@ -171,12 +169,12 @@ void DeviceChaos(unsigned seed, sim::Machine* machine, bool heldCancels) {
 
 // The block the stopped service left in the mapping is sane.
 bool SaneLastBlock(HANDLE mapping, std::string* why) {
-  void* view = MapViewOfFile(mapping, FILE_MAP_READ, 0, 0, kStateBlockSize);
-  if (view == nullptr) {
+  const auto* block =
+      static_cast<const StateBlock*>(MapViewOfFile(mapping, FILE_MAP_READ, 0, 0, kStateBlockSize));
+  if (block == nullptr) {
     *why = "mapping";
     return false;
   }
-  const auto* block = static_cast<const StateBlock*>(view);
   bool sane = true;
   auto check = [&](bool ok, const char* what) {
     if (!ok && sane) *why = what;
@@ -198,7 +196,7 @@ bool SaneLastBlock(HANDLE mapping, std::string* why) {
               block->published[i].productLineRef == nullptr,
           "row reference");
   }
-  UnmapViewOfFile(view);
+  UnmapViewOfFile(block);
   return sane;
 }
 
@@ -296,19 +294,20 @@ void RunCycle(const Options& options, sim::Machine* machine, HANDLE mapping, std
 bool ParseOptions(int argc, char** argv, Options* options) {
   for (int i = 1; i < argc; ++i) {
     const std::string word = argv[i];
-    const bool hasValue = i + 1 < argc;
-    if (word == "--cycles" && hasValue) {
-      options->cycles = std::atoi(argv[++i]);
-    } else if (word == "--run-ms" && hasValue) {
-      options->runMs = std::atoi(argv[++i]);
-    } else if (word == "--stop-limit-ms" && hasValue) {
-      options->stopLimitMs = std::atoi(argv[++i]);
-    } else if (word == "--seed" && hasValue) {
-      options->seed = static_cast<unsigned>(std::strtoul(argv[++i], nullptr, 10));
-    } else if (word == "--no-held-cancels") {
+    if (word == "--no-held-cancels") {
       options->heldCancels = false;
+      continue;
+    }
+    int* number = word == "--cycles"          ? &options->cycles
+                  : word == "--run-ms"        ? &options->runMs
+                  : word == "--stop-limit-ms" ? &options->stopLimitMs
+                                              : nullptr;
+    if (i + 1 == argc || (number == nullptr && word != "--seed")) return false;
+    const unsigned long value = std::strtoul(argv[++i], nullptr, 10);
+    if (number != nullptr) {
+      *number = static_cast<int>(value);
     } else {
-      return false;
+      options->seed = static_cast<unsigned>(value);
     }
   }
   return options->cycles > 0 && options->runMs >= 0 && options->stopLimitMs > 0;
