@@ -25,6 +25,8 @@ const char* ChildRole() {
   return (role != nullptr && *role != '\0') ? role : nullptr;
 }
 
+// Only the host's test programs start children.
+#if !defined(_WIN32)
 namespace {
 
 std::string FilterArgument() {
@@ -40,71 +42,6 @@ bool IsOwnVariable(const std::string& entry) {
 }
 
 }  // namespace
-
-#if defined(_WIN32)
-
-bool ChildProcess::Start(const char* role) {
-  if (Running()) return false;
-  WCHAR path[MAX_PATH];
-  DWORD length = GetModuleFileNameW(nullptr, path, MAX_PATH);
-  if (length == 0 || length >= MAX_PATH) return false;
-
-  WideString commandLine = WSTR("\"");
-  commandLine += path;
-  commandLine += WSTR("\" ");
-  commandLine += Utf8ToWide(FilterArgument());
-
-  // The parent's environment without our own variables, then the child's.
-  std::vector<WCHAR> block;
-  if (LPWCH current = GetEnvironmentStringsW()) {
-    for (LPWCH entry = current; *entry != 0; entry += WideLength(entry) + 1) {
-      if (IsOwnVariable(WideToUtf8(entry))) continue;
-      block.insert(block.end(), entry, entry + WideLength(entry) + 1);
-    }
-    FreeEnvironmentStringsW(current);
-  }
-  for (const std::string& extra :
-       {std::string(kChildRoleVariable) + "=" + role,
-        std::string(kOwnerPidVariable) + "=" + std::to_string(OwnerProcessId())}) {
-    WideString wide = Utf8ToWide(extra);
-    block.insert(block.end(), wide.begin(), wide.end());
-    block.push_back(0);
-  }
-  block.push_back(0);
-
-  STARTUPINFOW startup{};
-  startup.cb = sizeof(startup);
-  PROCESS_INFORMATION info{};
-  if (!CreateProcessW(path, commandLine.data(), nullptr, nullptr, FALSE, CREATE_UNICODE_ENVIRONMENT,
-                      block.data(), nullptr, &startup, &info)) {
-    return false;
-  }
-  CloseHandle(info.hThread);
-  id_ = reinterpret_cast<std::intptr_t>(info.hProcess);
-  return true;
-}
-
-int ChildProcess::Wait(DWORD timeoutMs) {
-  if (!Running()) return -2;
-  HANDLE process = reinterpret_cast<HANDLE>(id_);
-  int result = -1;
-  if (WaitForSingleObject(process, timeoutMs) == WAIT_OBJECT_0) {
-    DWORD code = 0;
-    if (GetExitCodeProcess(process, &code)) result = static_cast<int>(code);
-  } else {
-    TerminateProcess(process, 255);
-    WaitForSingleObject(process, kProcessGuardMs);
-  }
-  CloseHandle(process);
-  id_ = 0;
-  return result;
-}
-
-void ChildProcess::Kill() {
-  if (Running()) TerminateProcess(reinterpret_cast<HANDLE>(id_), 128 + 9);
-}
-
-#else
 
 bool ChildProcess::Start(const char* role) {
   if (Running()) return false;
@@ -135,8 +72,7 @@ int ChildProcess::Wait(DWORD timeoutMs) {
   pid_t pid = static_cast<pid_t>(id_);
   id_ = 0;
   int status = 0;
-  // A pidfd (the emulation watches its peers the same way) becomes readable
-  // when the child ends, which gives a bounded wait.
+  // A pidfd becomes readable when the child ends: a bounded wait.
   long pidfd = syscall(SYS_pidfd_open, pid, 0);
   pollfd entry{static_cast<int>(pidfd), POLLIN, 0};
   int ready = 0;
@@ -160,8 +96,6 @@ void ChildProcess::Kill() {
   if (Running()) kill(static_cast<pid_t>(id_), SIGKILL);
 }
 
-#endif
-
 ChildProcess::~ChildProcess() {
   if (Running()) Wait(0);
 }
@@ -171,5 +105,7 @@ int RunChildSelf(const char* role, DWORD timeoutMs) {
   if (!child.Start(role)) return -2;
   return child.Wait(timeoutMs);
 }
+
+#endif
 
 }  // namespace skytest
