@@ -8,7 +8,9 @@
 #include <cstring>
 #include <filesystem>
 
+#include "monitor/monitor_state.h"
 #include "pipe/command_message.h"
+#include "service/process_locks.h"
 
 namespace fuzzsupport {
 
@@ -93,6 +95,28 @@ void UsePrivateEmulation(const char* tag) {
     std::atexit(RemovePrivateRegistry);
   }
   setenv("SKYVANE_TIME_SCALE", "0.001", 0);
+}
+
+StateBlock* SetUpMonitor(bool withMapping) {
+  InitializeProcessLocks();
+  auto* block = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));
+  monitorState = MonitorState{};
+  monitorState.tick = 1;
+  monitorState.osKind = kOsXpOrLater;
+  monitorState.stateBlock = block;
+  monitorState.stateMutex = CreateMutexW(nullptr, FALSE, nullptr);
+  if (withMapping) {
+    monitorState.fileMapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0,
+                                                  kStateBlockSize, nullptr);
+  }
+  monitorState.pipeStopEvent = CreateEventW(nullptr, FALSE, FALSE, nullptr);
+  monitorState.stopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+  monitorState.workerStopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+  Check(block != nullptr && monitorState.stateMutex != nullptr &&
+            (monitorState.fileMapping != nullptr || !withMapping) &&
+            monitorState.pipeStopEvent != nullptr,
+        "set-up");
+  return block;
 }
 
 void KeepRegistrySmall() {

@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "machine.h"
+#include "monitor/state_block.h"
 #include "platform/posix/device_provider.h"
 
 // The first byte selects the target, the rest is its input.
@@ -40,6 +41,11 @@ void Check(bool condition, const char* what);
 // its own (unless the environment names them), so that random requests land
 // nowhere else and waits are short.
 void UsePrivateEmulation(const char* tag);
+
+// The surroundings the monitor gives the dispatcher: the process locks, the
+// monitor's state with a zeroed block (returned), its mutex and events, and a
+// mapping only when `withMapping`.
+StateBlock* SetUpMonitor(bool withMapping);
 
 // Removes the emulated registry store once random requests have made it
 // large: every registry call reads the whole store, so a growing store would

@@ -1,4 +1,3 @@
-#include <cstdlib>
 #include <cstring>
 #include <memory>
 
@@ -8,7 +7,6 @@
 #include "pipe/dispatcher.h"
 #include "pipe/pipe_instance.h"
 #include "pipe/registry_access.h"
-#include "service/process_locks.h"
 
 namespace {
 
@@ -24,17 +22,7 @@ void SetUpOnce() {
   done = true;
   fuzzsupport::UsePrivateEmulation("pipefuzz");
   computer = new fuzzsupport::RecordingComputer(std::make_unique<sim::Machine>());
-  InitializeProcessLocks();
-  static StateBlock* block = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));
-  monitorState = MonitorState{};
-  monitorState.stateBlock = block;
-  monitorState.stateMutex = CreateMutexW(nullptr, FALSE, nullptr);
-  monitorState.fileMapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0,
-                                                kStateBlockSize, nullptr);
-  monitorState.pipeStopEvent = CreateEventW(nullptr, FALSE, FALSE, nullptr);
-  Check(block != nullptr && monitorState.stateMutex != nullptr &&
-            monitorState.fileMapping != nullptr && monitorState.pipeStopEvent != nullptr,
-        "set-up");
+  fuzzsupport::SetUpMonitor(true);
 }
 
 void FuzzDispatcher(const std::uint8_t* data, std::size_t size) {
