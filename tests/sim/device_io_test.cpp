@@ -8,6 +8,7 @@
 #include <cstring>
 #include <string>
 
+#include "service/process_locks.h"
 #include "sim_helpers.h"
 #include "support/test_support.h"
 
@@ -109,32 +110,28 @@ TEST_F(DeviceIo, VanishingDeviceCompletesPendingAndLaterRequestsWithItsError) {
 // CancelIo only (another thread's ends when the handle closes), and a slow
 // cancel still writes the reply into the caller's buffers.
 TEST_F(DeviceIo, InjectedFaultsComeAndGoAsTold) {
+  InitializeProcessLocks();  // the service's transfers take the pass-through lock
   const std::string disk = PathWith(GUID_DEVINTERFACE_DISK, "374b3241");
   machine->FailOpen("gauge", sim::Endpoint::Disk, ERROR_ACCESS_DENIED, 1);
   EXPECT_EQ(OpenDevice(disk), INVALID_HANDLE_VALUE);
   EXPECT_EQ(GetLastError(), ERROR_ACCESS_DENIED);
-  HANDLE device = OpenDevice(disk, false);
+  HANDLE device = OpenDevice(disk);
   ASSERT_NE(device, INVALID_HANDLE_VALUE);
   machine->FailIo("gauge", sim::Endpoint::Disk, ERROR_GEN_FAILURE, 2, 0x12);
+  DWORD lastBlock = 0;
+  DWORD blockLength = 0;
+  EXPECT_EQ(ScsiReadCapacity(device, &lastBlock, &blockLength, nullptr), 0u);  // not failed
   std::uint8_t data[74] = {};
-  PassThroughRequest capacity = Inquiry(data);
-  capacity.sptd.Cdb[0] = 0x25;  // READ CAPACITY is not failed
-  capacity.sptd.CdbLength = 10;
-  capacity.sptd.Cdb[4] = 0;
-  capacity.sptd.DataTransferLength = 8;
-  EXPECT_TRUE(Scsi(device, &capacity));
-  PassThroughRequest request = Inquiry(data);
-  for (int i = 0; i < 2; ++i) {
-    EXPECT_FALSE(Scsi(device, &request));
-    EXPECT_EQ(GetLastError(), ERROR_GEN_FAILURE);
+  for (DWORD expected : {ERROR_GEN_FAILURE, ERROR_GEN_FAILURE, DWORD{0}}) {
+    EXPECT_EQ(ScsiInquiry(device, data, nullptr), expected);
   }
-  EXPECT_TRUE(Scsi(device, &request));
   EXPECT_TRUE(CloseHandle(device));
 
   device = OpenDevice(disk);
   ASSERT_NE(device, INVALID_HANDLE_VALUE);
   machine->HangIo("gauge", sim::Endpoint::Disk, true);
   std::memset(data, 0, sizeof data);
+  PassThroughRequest request = Inquiry(data);
   std::uint8_t otherData[74] = {};
   PassThroughRequest otherRequest = Inquiry(otherData);
   Overlapped other;

@@ -68,7 +68,7 @@ end
   PassThroughRequest r = Inquiry(data);
   ASSERT_TRUE(Scsi(device, &r));
   EXPECT_EQ(data[4], 31);
-  EXPECT_EQ(r.sptd.DataTransferLength, 36u);
+  EXPECT_EQ(r.spt.DataTransferLength, 36u);
   EXPECT_TRUE(CloseHandle(device));
   GUID hid{};
   HidD_GetHidGuid(&hid);

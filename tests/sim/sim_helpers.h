@@ -15,30 +15,23 @@
 #include "machine.h"
 #include "platform/wide.h"
 #include "platform/win32.h"
+#include "transport/pass_through.h"
 
 namespace simtest {
-
-// The 80-byte pass-through request of the service.
-struct PassThroughRequest {
-  SCSI_PASS_THROUGH_DIRECT sptd;
-  ULONG totalLength;
-  UCHAR sense[20];
-};
-static_assert(sizeof(PassThroughRequest) == 80);
 
 // An INQUIRY of 74 bytes into `data`.
 inline PassThroughRequest Inquiry(std::uint8_t (&data)[74]) {
   PassThroughRequest r{};
-  r.sptd.Length = sizeof(SCSI_PASS_THROUGH_DIRECT);
-  r.sptd.CdbLength = 6;
-  r.sptd.SenseInfoLength = 18;
-  r.sptd.DataIn = SCSI_IOCTL_DATA_IN;
-  r.sptd.DataTransferLength = sizeof data;
-  r.sptd.TimeOutValue = 20;
-  r.sptd.DataBuffer = data;
-  r.sptd.SenseInfoOffset = 60;
-  r.sptd.Cdb[0] = 0x12;
-  r.sptd.Cdb[4] = sizeof data;
+  r.spt.Length = sizeof(SCSI_PASS_THROUGH_DIRECT);
+  r.spt.CdbLength = 6;
+  r.spt.SenseInfoLength = 18;
+  r.spt.DataIn = SCSI_IOCTL_DATA_IN;
+  r.spt.DataTransferLength = sizeof data;
+  r.spt.TimeOutValue = 20;
+  r.spt.DataBuffer = data;
+  r.spt.SenseInfoOffset = 60;
+  r.spt.Cdb[0] = 0x12;
+  r.spt.Cdb[4] = sizeof data;
   r.totalLength = 80;
   return r;
 }
