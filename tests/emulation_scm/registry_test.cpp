@@ -27,25 +27,28 @@ LSTATUS SetDword(HKEY key, const WCHAR* name, DWORD value) {
                         sizeof value);
 }
 
+// The DWORD value, or 0xBAD when it cannot be read.
+DWORD GetDword(HKEY key, const WCHAR* name) {
+  DWORD value = 0;
+  DWORD size = sizeof value;
+  return RegQueryValueExW(key, name, nullptr, nullptr, reinterpret_cast<BYTE*>(&value), &size) ==
+                 ERROR_SUCCESS
+             ? value
+             : 0xBAD;
+}
+
 std::string ReadFile(const std::string& path) {
   std::ifstream in(path, std::ios::binary);
   return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
 }
 
-// Each case works below a key of its own, removed before and after.
+// Each case works below a key of its own (and every test process has a
+// registry store of its own).
 class Registry : public ::testing::Test {
  protected:
   void SetUp() override {
     base_ = u"Software\\SkyvaneEmuTest\\" +
             Utf8ToWide(::testing::UnitTest::GetInstance()->current_test_info()->name());
-    Erase();
-  }
-  void TearDown() override { Erase(); }
-  void Erase() {
-    emu::registry::Transact([&](emu::registry::Store& store) {
-      store.EraseTree(u"HKEY_CURRENT_USER\\" + base_);
-      return true;
-    });
   }
   WideString Path(const WideString& sub) const { return sub.empty() ? base_ : base_ + u"\\" + sub; }
   LSTATUS Create(const WideString& sub, Key& key) {
@@ -124,12 +127,7 @@ TEST_F(Registry, AccessRightsAndReadOnlyKeys) {
   EXPECT_EQ(Create(u"Locked\\Child", key), ERROR_ACCESS_DENIED);
   EXPECT_EQ(Create(u"Locked\\Child\\Below", key), ERROR_ACCESS_DENIED);
   ASSERT_EQ(Open(u"Locked\\Child", KEY_READ, key), ERROR_SUCCESS);
-  DWORD value = 0;
-  DWORD size = sizeof value;
-  EXPECT_EQ(
-      RegQueryValueExW(key.Get(), u"V", nullptr, nullptr, reinterpret_cast<BYTE*>(&value), &size),
-      ERROR_SUCCESS);
-  EXPECT_EQ(value, 7u);
+  EXPECT_EQ(GetDword(key.Get(), u"V"), 7u);
   Key parent;
   ASSERT_EQ(Open(u"Locked", KEY_ALL_ACCESS, parent), ERROR_SUCCESS);
   EXPECT_EQ(RegDeleteKeyW(parent.Get(), u"Child"), ERROR_ACCESS_DENIED);
@@ -176,13 +174,7 @@ TEST_F(Registry, ProcessesShareTheStoreWithoutLostWrites) {
   ASSERT_EQ(Open(u"Shared", KEY_READ, key), ERROR_SUCCESS);
   for (int c = 0; c < 2; ++c) {
     for (int i = 0; i < kPerChild; ++i) {
-      DWORD value = 0;
-      DWORD size = sizeof value;
-      ASSERT_EQ(RegQueryValueExW(key.Get(), name(c, i).c_str(), nullptr, nullptr,
-                                 reinterpret_cast<BYTE*>(&value), &size),
-                ERROR_SUCCESS)
-          << c << "-" << i;
-      EXPECT_EQ(value, static_cast<DWORD>(c * 1000 + i));
+      EXPECT_EQ(GetDword(key.Get(), name(c, i).c_str()), static_cast<DWORD>(c * 1000 + i));
     }
   }
 }
