@@ -22,7 +22,7 @@ using skytest::NewEvent;
 using skytest::RunAsChild;
 using skytest::Thread;
 
-TEST(Handles, CountedAndNeverValidAfterClose) {
+TEST(Handles, HandlesAndThreadsAreCountedAndAClosedHandleIsNeverValid) {
   long before = platform::LiveHandleCount();
   HANDLE event = CreateEventW(nullptr, TRUE, FALSE, nullptr);
   HANDLE mutex = CreateMutexW(nullptr, FALSE, nullptr);
@@ -43,9 +43,8 @@ TEST(Handles, CountedAndNeverValidAfterClose) {
   EXPECT_EQ(platform::LiveHandleCount(), before);
   EXPECT_FALSE(CloseHandle(nullptr));
   EXPECT_TRUE(CloseHandle(GetCurrentProcess()));
-}
 
-TEST(Threads, CountedUntilTheyEndEvenWithTheirHandleClosedFirst) {
+  // A thread counts until it ends, even with its handle closed first.
   Handle release = NewEvent(true, false);
   HANDLE thread = CreateThread(
       nullptr, 0, [](LPVOID p) -> DWORD { return WaitForSingleObject(p, INFINITE); }, release.Get(),
