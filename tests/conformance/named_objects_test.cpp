@@ -1,21 +1,17 @@
 // Named kernel objects under "Global\": the pagefile-backed mapping, the
 // mutex and the events that the service shares with the user-interface
 // process. Creating an existing name opens the same object
-// (ERROR_ALREADY_EXISTS), another process sees it, and it lives as long as
-// any handle does.
+// (ERROR_ALREADY_EXISTS). (Other processes' use of them is proven on the host
+// by the emulation's process tests and end to end by the host run.)
 #include <gtest/gtest.h>
 
-#include <cstring>
 #include <functional>
 
-#include "support/child_process.h"
 #include "support/test_support.h"
 
 namespace {
 
-using skytest::ChildRole;
 using skytest::Handle;
-using skytest::kGuardMs;
 
 constexpr DWORD kBlockBytes = 1215512;  // the size of the service's state block
 
@@ -38,22 +34,6 @@ class View {
  private:
   void* base_;
 };
-
-// Security attributes with a null DACL, as the service creates its objects.
-struct OpenToAll {
-  SECURITY_DESCRIPTOR descriptor{};
-  SECURITY_ATTRIBUTES attributes{};
-  OpenToAll() {
-    InitializeSecurityDescriptor(&descriptor, SECURITY_DESCRIPTOR_REVISION);
-    SetSecurityDescriptorDacl(&descriptor, TRUE, nullptr, FALSE);
-    attributes = {sizeof(attributes), &descriptor, FALSE};
-  }
-};
-
-Handle CreateBlockMapping(const WideString& name, SECURITY_ATTRIBUTES* attributes = nullptr) {
-  return Handle(CreateFileMappingW(INVALID_HANDLE_VALUE, attributes, PAGE_READWRITE, 0, kBlockBytes,
-                                   name.c_str()));
-}
 
 // The three kinds of named object, each with its create and open call and a
 // check that two handles reach one object.
@@ -116,100 +96,6 @@ TEST(NamedObjects, CreatingOrOpeningANameReachesTheSameObjectOfItsKindOnly) {
       EXPECT_EQ(GetLastError(), ERROR_INVALID_HANDLE) << other.name;
     }
   }
-}
-
-TEST(NamedObjects, MappingCreatedByOneProcessIsReadByAnother) {
-  WideString name = GlobalName("map");
-  if (ChildRole() != nullptr) {
-    // The reader: opens the parent's mapping by name, checks the parent's
-    // bytes and answers in the same memory.
-    Handle opened(OpenFileMappingW(FILE_MAP_ALL_ACCESS, FALSE, name.c_str()));
-    ASSERT_TRUE(opened) << GetLastError();
-    View view(opened.Get(), FILE_MAP_ALL_ACCESS);
-    ASSERT_TRUE(view);
-    EXPECT_EQ(std::memcmp(view.Bytes(), "block", 5), 0);
-    EXPECT_EQ(view.Bytes()[kBlockBytes - 1], 0x5A);
-    EXPECT_EQ(view.Bytes()[kBlockBytes / 2], 0);  // never written: zero-filled
-    std::memcpy(view.Bytes() + 1000, "seen", 4);
-    SetLastError(0);
-    Handle created = CreateBlockMapping(name);  // opens the parent's block too
-    ASSERT_TRUE(created);
-    EXPECT_EQ(GetLastError(), ERROR_ALREADY_EXISTS);
-    return;
-  }
-  OpenToAll security;
-  Handle mapping = CreateBlockMapping(name, &security.attributes);
-  ASSERT_TRUE(mapping);
-  View view(mapping.Get(), FILE_MAP_ALL_ACCESS);
-  ASSERT_TRUE(view);
-  std::memcpy(view.Bytes(), "block", 5);
-  view.Bytes()[kBlockBytes - 1] = 0x5A;
-  ASSERT_EQ(skytest::RunChildSelf("reader", skytest::kProcessGuardMs), 0);
-  EXPECT_EQ(std::memcmp(view.Bytes() + 1000, "seen", 4), 0);
-}
-
-TEST(NamedObjects, MappingLivesAsLongAsAnyHandleAndThenGoes) {
-  WideString name = GlobalName("map");
-  Handle creator = CreateBlockMapping(name);
-  ASSERT_TRUE(creator);
-  {
-    View view(creator.Get(), FILE_MAP_ALL_ACCESS);
-    ASSERT_TRUE(view);
-    view.Bytes()[kBlockBytes - 4] = 0x77;
-  }
-  Handle reader(OpenFileMappingW(FILE_MAP_READ, FALSE, name.c_str()));
-  ASSERT_TRUE(reader);
-  creator.Reset();  // the creator is gone; the reader still holds the block
-  {
-    Handle again(OpenFileMappingW(FILE_MAP_READ, FALSE, name.c_str()));
-    ASSERT_TRUE(again);
-    View view(again.Get(), FILE_MAP_READ);
-    ASSERT_TRUE(view);
-    EXPECT_EQ(view.Bytes()[kBlockBytes - 4], 0x77);
-  }
-  reader.Reset();
-  // With the last handle closed the name is free and a new block starts zeroed.
-  SetLastError(ERROR_INVALID_DATA);
-  Handle fresh = CreateBlockMapping(name);
-  ASSERT_TRUE(fresh);
-  EXPECT_EQ(GetLastError(), ERROR_SUCCESS);
-  View view(fresh.Get(), FILE_MAP_READ);
-  ASSERT_TRUE(view);
-  EXPECT_EQ(view.Bytes()[kBlockBytes - 4], 0);
-}
-
-TEST(NamedObjects, MutexAndEventsWorkAcrossProcessesAndAbandonOnExit) {
-  WideString mutexName = GlobalName("mutex");
-  WideString readyName = GlobalName("ready");
-  WideString goName = GlobalName("go");
-  if (ChildRole() != nullptr) {
-    // The peer: finds the mutex held by the parent, says so, waits for the
-    // parent to let go, takes the mutex and ends while owning it.
-    Handle mutex(OpenMutexW(SYNCHRONIZE | MUTEX_MODIFY_STATE, FALSE, mutexName.c_str()));
-    SetLastError(0);
-    Handle ready(CreateEventW(nullptr, TRUE, FALSE, readyName.c_str()));
-    EXPECT_EQ(GetLastError(), ERROR_ALREADY_EXISTS);
-    Handle go(OpenEventW(SYNCHRONIZE | EVENT_MODIFY_STATE, FALSE, goName.c_str()));
-    ASSERT_TRUE(mutex && ready && go);
-    ASSERT_EQ(WaitForSingleObject(mutex.Get(), 0), WAIT_TIMEOUT);
-    ASSERT_TRUE(SetEvent(ready.Get()));
-    ASSERT_EQ(WaitForSingleObject(go.Get(), kGuardMs), WAIT_OBJECT_0);
-    ASSERT_EQ(WaitForSingleObject(mutex.Get(), kGuardMs), WAIT_OBJECT_0);
-    return;  // handles close; ownership ends with the process
-  }
-  OpenToAll security;
-  Handle mutex(CreateMutexW(&security.attributes, TRUE, mutexName.c_str()));
-  Handle ready(CreateEventW(&security.attributes, TRUE, FALSE, readyName.c_str()));
-  Handle go(CreateEventW(&security.attributes, FALSE, FALSE, goName.c_str()));
-  ASSERT_TRUE(mutex && ready && go);
-  skytest::ChildProcess child;
-  ASSERT_TRUE(child.Start("peer"));
-  ASSERT_EQ(WaitForSingleObject(ready.Get(), kGuardMs), WAIT_OBJECT_0);
-  ASSERT_TRUE(ReleaseMutex(mutex.Get()));
-  ASSERT_TRUE(SetEvent(go.Get()));
-  ASSERT_EQ(child.Wait(skytest::kProcessGuardMs), 0);
-  EXPECT_EQ(WaitForSingleObject(mutex.Get(), kGuardMs), WAIT_ABANDONED);
-  EXPECT_TRUE(ReleaseMutex(mutex.Get()));
 }
 
 }  // namespace

@@ -30,21 +30,6 @@ HANDLE OpenClient() {
   return CreateFileW(kPipe, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr);
 }
 
-// Synchronous client process: one request, one reply, then close.
-int ClientExchange() {
-  if (!WaitNamedPipeW(kPipe, NMPWAIT_WAIT_FOREVER)) return 20;
-  HANDLE pipe = OpenClient();
-  if (pipe == INVALID_HANDLE_VALUE) return 21;
-  DWORD mode = PIPE_READMODE_MESSAGE;
-  if (!SetNamedPipeHandleState(pipe, &mode, nullptr, nullptr)) return 22;
-  char reply[16] = {};
-  DWORD bytes = 0;
-  if (!WriteFile(pipe, "ping", 4, &bytes, nullptr)) return 23;
-  if (!ReadFile(pipe, reply, sizeof(reply), &bytes, nullptr)) return 24;
-  if (bytes != 5 || std::memcmp(reply, "pong!", 5) != 0) return 25;
-  return CloseHandle(pipe) ? 0 : 26;
-}
-
 // Waits for the overlapped request on `ov` to finish; its result and count.
 bool Finish(HANDLE server, OVERLAPPED* ov, BOOL started, DWORD* bytes) {
   if (!started && GetLastError() != ERROR_IO_PENDING) return false;
@@ -52,25 +37,23 @@ bool Finish(HANDLE server, OVERLAPPED* ov, BOOL started, DWORD* bytes) {
   return GetOverlappedResult(server, ov, bytes, FALSE) != FALSE;
 }
 
-// Serves one client process's "ping" with "pong!" on a listening instance
-// (the server's overlapped requests are completed by the other process's
-// actions); the next read then finds the pipe broken. The case must call
-// RunAsChild("exchange", ClientExchange) first.
+// The instance connects a new client and carries one request and reply.
 void ServeOneExchange(HANDLE server, OVERLAPPED* ov) {
-  skytest::ChildProcess child;
-  ASSERT_TRUE(child.Start("exchange"));
   DWORD bytes = 0;
   BOOL connected = ConnectNamedPipe(server, ov);
-  if (connected || GetLastError() != ERROR_PIPE_CONNECTED) {
-    ASSERT_TRUE(Finish(server, ov, connected, &bytes));
-  }
-  char request[16] = {};
-  ASSERT_TRUE(Finish(server, ov, ReadFile(server, request, sizeof(request), &bytes, ov), &bytes));
-  EXPECT_EQ(std::string(request, bytes), "ping");
+  ASSERT_FALSE(connected);
+  ASSERT_EQ(GetLastError(), ERROR_IO_PENDING);
+  skytest::Handle client(OpenClient());
+  ASSERT_TRUE(client);
+  ASSERT_TRUE(Finish(server, ov, TRUE, &bytes));  // the connect, pending above
+  char buffer[16] = {};
+  ASSERT_TRUE(WriteFile(client.Get(), "ping", 4, &bytes, nullptr));
+  ASSERT_TRUE(Finish(server, ov, ReadFile(server, buffer, sizeof(buffer), &bytes, ov), &bytes));
+  EXPECT_EQ(std::string(buffer, bytes), "ping");
   ASSERT_TRUE(Finish(server, ov, WriteFile(server, "pong!", 5, &bytes, ov), &bytes));
-  EXPECT_EQ(child.Wait(skytest::kProcessGuardMs), 0);
-  EXPECT_FALSE(Finish(server, ov, ReadFile(server, request, sizeof(request), &bytes, ov), &bytes));
-  EXPECT_EQ(GetLastError(), ERROR_BROKEN_PIPE);
+  ASSERT_TRUE(ReadFile(client.Get(), buffer, sizeof(buffer), &bytes, nullptr));
+  EXPECT_EQ(std::string(buffer, bytes), "pong!");
+  client.Reset();
   EXPECT_TRUE(DisconnectNamedPipe(server));
 }
 
@@ -117,7 +100,6 @@ int ClientUntilKilled(KillPoint point) {
 
 TEST_P(KilledClient, ServerProcessGoesOn) {
   const KillPoint point = GetParam();
-  RunAsChild("exchange", ClientExchange);
   RunAsChild("doomed", [point] { return ClientUntilKilled(point); });
   HANDLE server = CreateServer();
   HANDLE up = CreateEventW(nullptr, TRUE, FALSE, u"Global\\EmuKillUp");
@@ -153,7 +135,6 @@ TEST_P(KilledClient, ServerProcessGoesOn) {
   EXPECT_TRUE(ReleaseMutex(mutex));
   EXPECT_EQ(WaitForSingleObject(idle, 0), WAIT_TIMEOUT);
   EXPECT_TRUE(DisconnectNamedPipe(server));
-  ServeOneExchange(server, &ov);
   ServeOneExchange(server, &ov);
   for (HANDLE h : {event, mutex, idle, up, server}) CloseHandle(h);
 }

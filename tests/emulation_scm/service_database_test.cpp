@@ -1,10 +1,12 @@
 // The emulated service database: install and remove, kept in the registry
-// where Windows keeps it and so seen by every process. (The event log's
-// records are asserted by the service's own tests.)
+// where Windows keeps it and so seen by every process, and the executable's
+// path that install records. (The event log's records are asserted by the
+// service's own tests.)
 #include <gtest/gtest.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <climits>
 #include <string>
 
 #include "platform/wide.h"
@@ -101,6 +103,16 @@ TEST(ServiceDatabase, InstallQueryAndRemove) {
   EXPECT_EQ(OpenServiceW(manager, u"EmuDbSvc", SERVICE_ALL_ACCESS), nullptr);
   EXPECT_EQ(GetLastError(), ERROR_SERVICE_DOES_NOT_EXIST);
   EXPECT_TRUE(CloseServiceHandle(manager));
+}
+
+// The install verb records the executable's path as the image path.
+TEST(ServiceDatabase, ModuleFileNameIsTheExecutable) {
+  char exe[PATH_MAX];
+  const ssize_t length = readlink("/proc/self/exe", exe, sizeof exe - 1);
+  ASSERT_GT(length, 0);
+  WCHAR buffer[PATH_MAX];
+  EXPECT_EQ(GetModuleFileNameW(nullptr, buffer, PATH_MAX), static_cast<DWORD>(length));
+  EXPECT_EQ(WideToUtf8(buffer), std::string(exe, static_cast<std::size_t>(length)));
 }
 
 }  // namespace

@@ -1,12 +1,9 @@
-#include "drive_fuzz_entry.h"
-
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
 #include <memory>
 #include <set>
 #include <string>
-#include <string_view>
 #include <vector>
 
 #include "discovery/channel_binding.h"
@@ -17,7 +14,6 @@
 #include "pipe/command_message.h"
 #include "pipe/dispatcher.h"
 #include "pipe/pipe_instance.h"
-#include "service/process_locks.h"
 #include "transport/button_events.h"
 #include "volume/volume_letters.h"
 
@@ -29,7 +25,7 @@ constexpr std::uint32_t kDriveCommands[] = {kCommandSafeRemove,       kCommandRe
                                             kCommandReleaseDriveAlso, kCommandRefreshGauges,
                                             kCommandReadStatus,       kCommandWriteControl};
 
-fuzzsupport::RecordingModel* computer = nullptr;
+fuzzsupport::RecordingComputer* computer = nullptr;
 StateBlock* block = nullptr;
 StateBlock* snapshot = nullptr;
 HANDLE channelHandles[kMaxChannels] = {};
@@ -104,18 +100,6 @@ void Scan() {
   std::memcpy(static_cast<void*>(snapshot), block, sizeof(StateBlock));
 }
 
-// The names of the drives the machine description declares ("drive NAME").
-std::vector<std::string> DriveNames(std::string_view text) {
-  std::vector<std::string> names;
-  while (!text.empty()) {
-    const std::size_t end = std::min(text.find('\n'), text.size());
-    const std::string_view line = text.substr(0, end);
-    if (line.substr(0, 6) == "drive ") names.emplace_back(line.substr(6));
-    text.remove_prefix(std::min(end + 1, text.size()));
-  }
-  return names;
-}
-
 void SetUpOnce() {
   static bool done = false;
   if (done) return;
@@ -125,28 +109,14 @@ void SetUpOnce() {
   std::unique_ptr<sim::Machine> machine = sim::LoadMachine(sim::DefaultMachineText(), &error);
   Check(machine != nullptr, "the default machine loads");
   machine->SetDeviceEventSink([](DWORD, const void*) {});
-  driveNames = DriveNames(sim::DefaultMachineText());
-  Check(!driveNames.empty(), "the default machine names its drives");
-  computer = new fuzzsupport::RecordingModel(std::move(machine));
-  emu::SetDeviceModel(computer);
-  InitializeProcessLocks();
-  block = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));
+  for (const sim::Machine::DriveSummary& drive : machine->Drives())
+    driveNames.push_back(drive.name);
+  computer = new fuzzsupport::RecordingComputer(std::move(machine));
+  // No mapping: a publish then copies nothing. The pipe target covers
+  // publishing; here a 1.2 MB copy per input would take most of the time.
+  block = fuzzsupport::SetUpMonitor(false);
   snapshot = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));
-  monitorState = MonitorState{};
-  monitorState.tick = 1;
-  monitorState.osKind = kOsXpOrLater;
-  monitorState.stateBlock = block;
-  monitorState.stateMutex = CreateMutexW(nullptr, FALSE, nullptr);
-  // No mapping: a publish then fails to map a view and copies nothing. The
-  // pipe target covers publishing; here a 1.2 MB copy per input would take
-  // most of the time.
-  monitorState.fileMapping = nullptr;
-  monitorState.pipeStopEvent = CreateEventW(nullptr, FALSE, FALSE, nullptr);
-  monitorState.stopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
-  monitorState.workerStopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
-  Check(block != nullptr && snapshot != nullptr && monitorState.stateMutex != nullptr &&
-            monitorState.pipeStopEvent != nullptr,
-        "set-up");
+  Check(snapshot != nullptr, "set-up");
   Scan();
 }
 

@@ -8,7 +8,9 @@
 #include <cstring>
 #include <filesystem>
 
+#include "monitor/monitor_state.h"
 #include "pipe/command_message.h"
+#include "service/process_locks.h"
 
 namespace fuzzsupport {
 
@@ -95,6 +97,28 @@ void UsePrivateEmulation(const char* tag) {
   setenv("SKYVANE_TIME_SCALE", "0.001", 0);
 }
 
+StateBlock* SetUpMonitor(bool withMapping) {
+  InitializeProcessLocks();
+  auto* block = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));
+  monitorState = MonitorState{};
+  monitorState.tick = 1;
+  monitorState.osKind = kOsXpOrLater;
+  monitorState.stateBlock = block;
+  monitorState.stateMutex = CreateMutexW(nullptr, FALSE, nullptr);
+  if (withMapping) {
+    monitorState.fileMapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0,
+                                                  kStateBlockSize, nullptr);
+  }
+  monitorState.pipeStopEvent = CreateEventW(nullptr, FALSE, FALSE, nullptr);
+  monitorState.stopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+  monitorState.workerStopEvent = CreateEventW(nullptr, TRUE, FALSE, nullptr);
+  Check(block != nullptr && monitorState.stateMutex != nullptr &&
+            (monitorState.fileMapping != nullptr || !withMapping) &&
+            monitorState.pipeStopEvent != nullptr,
+        "set-up");
+  return block;
+}
+
 void KeepRegistrySmall() {
   const char* store = std::getenv("SKYVANE_REGISTRY");
   if (store == nullptr) return;
@@ -103,20 +127,26 @@ void KeepRegistrySmall() {
   if (!ignored && size > 4096) std::filesystem::remove(store, ignored);
 }
 
-std::vector<std::u16string> RecordingModel::TakeOpened() {
+RecordingComputer::RecordingComputer(std::unique_ptr<sim::Machine> machine)
+    : machine_(std::move(machine)) {
+  machine_->Install();  // answers every device call but opens, which come here
+  emu::SetDeviceProvider(this);
+}
+
+std::vector<std::u16string> RecordingComputer::TakeOpened() {
   std::lock_guard<std::mutex> lock(mutex_);
   std::vector<std::u16string> taken;
   taken.swap(opened_);
   return taken;
 }
 
-std::unique_ptr<emu::DeviceFile> RecordingModel::Open(const WCHAR* path, DWORD access, DWORD share,
-                                                      DWORD flags, DWORD* error) {
+std::unique_ptr<emu::DeviceFile> RecordingComputer::Open(const WCHAR* path, DWORD access,
+                                                         DWORD share, DWORD flags, DWORD* error) {
   {
     std::lock_guard<std::mutex> lock(mutex_);
     opened_.emplace_back(path);
   }
-  return inner_->Open(path, access, share, flags, error);
+  return machine_->Open(path, access, share, flags, error);
 }
 
 void CheckReply(const std::uint8_t* original, std::size_t received, const std::uint8_t* reply,

@@ -1,6 +1,7 @@
-// What the two fuzzing entries of the command channel share: a private
-// emulated namespace and registry, a computer that records every path the
-// service opens, and the checks every reply must pass.
+// The two fuzzing entries of the command channel, shared by the libFuzzer
+// targets and the plain corpus replay, and what they share: a private emulated
+// namespace and registry, a computer that records every path the service
+// opens, and the checks every reply must pass. A violation aborts.
 #pragma once
 
 #include <cstddef>
@@ -11,7 +12,25 @@
 #include <vector>
 
 #include "machine.h"
-#include "platform/posix/device_model.h"
+#include "monitor/state_block.h"
+#include "platform/posix/device_provider.h"
+
+// The first byte selects the target, the rest is its input.
+//   even: a pipe message as the server would have read it, fed to the
+//         dispatcher with the count of bytes received;
+//   odd:  a registry request (fixed part and texts) of exactly that many
+//         bytes delivered, fed to the registry access alone.
+// The dispatcher runs on a computer without drives, so no path may be opened
+// at all; a refused registry request stays unchanged.
+int PipeFuzzOneInput(const std::uint8_t* data, std::size_t size);
+
+// The commands that reach drives and channels (1, 2, 3, 9, 11 and 12) on the
+// embedded default machine. The first byte selects the command (low three
+// bits, modulo six), whether monitoring is paused (0x08), and which of the
+// service's drives the image's key names (high four bits; beyond the last
+// drive the key is left as it arrived). The rest is the message as the server
+// would have read it. No path may be opened that the service did not find.
+int DriveFuzzOneInput(const std::uint8_t* data, std::size_t size);
 
 namespace fuzzsupport {
 
@@ -23,55 +42,29 @@ void Check(bool condition, const char* what);
 // nowhere else and waits are short.
 void UsePrivateEmulation(const char* tag);
 
+// The surroundings the monitor gives the dispatcher: the process locks, the
+// monitor's state with a zeroed block (returned), its mutex and events, and a
+// mapping only when `withMapping`.
+StateBlock* SetUpMonitor(bool withMapping);
+
 // Removes the emulated registry store once random requests have made it
 // large: every registry call reads the whole store, so a growing store would
 // slow each execution down.
 void KeepRegistrySmall();
 
-// A computer that answers as `inner` does and records every path opened.
-class RecordingModel : public emu::DeviceModel {
+// Installs `machine` as the computer and answers every open as it does,
+// recording the path.
+class RecordingComputer : public emu::DeviceProvider {
  public:
-  explicit RecordingModel(std::unique_ptr<sim::Machine> inner) : inner_(std::move(inner)) {}
-  sim::Machine& Inner() { return *inner_; }
+  explicit RecordingComputer(std::unique_ptr<sim::Machine> machine);
+  sim::Machine& Inner() { return *machine_; }
   // The paths opened since the last call, in order.
   std::vector<std::u16string> TakeOpened();
-
-  bool ListInterfaces(const GUID& interfaceClass, std::vector<emu::InterfaceEntry>* out,
-                      DWORD* error) override {
-    return inner_->ListInterfaces(interfaceClass, out, error);
-  }
-  CONFIGRET Parent(DEVINST node, DEVINST* parent) override { return inner_->Parent(node, parent); }
-  CONFIGRET InstanceId(DEVINST node, std::u16string* id) override {
-    return inner_->InstanceId(node, id);
-  }
-  CONFIGRET Locate(std::u16string_view instanceId, DEVINST* node) override {
-    return inner_->Locate(instanceId, node);
-  }
-  CONFIGRET Property(DEVINST node, DWORD spdrp, DWORD* regType, std::vector<BYTE>* data) override {
-    return inner_->Property(node, spdrp, regType, data);
-  }
-  CONFIGRET Eject(DEVINST node, bool queryAndRemove, PNP_VETO_TYPE* vetoType,
-                  std::u16string* vetoName) override {
-    return inner_->Eject(node, queryAndRemove, vetoType, vetoName);
-  }
-  bool ModuleLoads(std::u16string_view module, DWORD* error) override {
-    return inner_->ModuleLoads(module, error);
-  }
-  bool ExportPresent(std::u16string_view module, std::string_view name) override {
-    return inner_->ExportPresent(module, name);
-  }
-  DWORD LogicalDrives() override { return inner_->LogicalDrives(); }
-  UINT DriveType(WCHAR letter) override { return inner_->DriveType(letter); }
-  bool FreeSpace(WCHAR letter, ULONGLONG* availableToCaller, ULONGLONG* total, ULONGLONG* totalFree,
-                 DWORD* error) override {
-    return inner_->FreeSpace(letter, availableToCaller, total, totalFree, error);
-  }
-  emu::OsVersion Version() override { return inner_->Version(); }
   std::unique_ptr<emu::DeviceFile> Open(const WCHAR* path, DWORD access, DWORD share, DWORD flags,
                                         DWORD* error) override;
 
  private:
-  std::unique_ptr<sim::Machine> inner_;
+  std::unique_ptr<sim::Machine> machine_;
   std::mutex mutex_;
   std::vector<std::u16string> opened_;
 };

@@ -1,6 +1,3 @@
-#include "pipe_fuzz_entry.h"
-
-#include <cstdlib>
 #include <cstring>
 #include <memory>
 
@@ -10,13 +7,12 @@
 #include "pipe/dispatcher.h"
 #include "pipe/pipe_instance.h"
 #include "pipe/registry_access.h"
-#include "service/process_locks.h"
 
 namespace {
 
 using fuzzsupport::Check;
 
-fuzzsupport::RecordingModel* computer = nullptr;
+fuzzsupport::RecordingComputer* computer = nullptr;
 
 // The surroundings the monitor gives the dispatcher, made once, on a computer
 // without drives: nothing a request names may ever be opened.
@@ -25,19 +21,8 @@ void SetUpOnce() {
   if (done) return;
   done = true;
   fuzzsupport::UsePrivateEmulation("pipefuzz");
-  computer = new fuzzsupport::RecordingModel(std::make_unique<sim::Machine>());
-  emu::SetDeviceModel(computer);
-  InitializeProcessLocks();
-  static StateBlock* block = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));
-  monitorState = MonitorState{};
-  monitorState.stateBlock = block;
-  monitorState.stateMutex = CreateMutexW(nullptr, FALSE, nullptr);
-  monitorState.fileMapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0,
-                                                kStateBlockSize, nullptr);
-  monitorState.pipeStopEvent = CreateEventW(nullptr, FALSE, FALSE, nullptr);
-  Check(block != nullptr && monitorState.stateMutex != nullptr &&
-            monitorState.fileMapping != nullptr && monitorState.pipeStopEvent != nullptr,
-        "set-up");
+  computer = new fuzzsupport::RecordingComputer(std::make_unique<sim::Machine>());
+  fuzzsupport::SetUpMonitor(true);
 }
 
 void FuzzDispatcher(const std::uint8_t* data, std::size_t size) {

@@ -1,18 +1,13 @@
 // Runs every file of the given corpus folders (or single files) once through
-// the fuzzing entry, so that any compiler's build checks the corpus.
+// the fuzzing entry named by FUZZ_ENTRY, so that any compiler's build checks
+// the corpus.
 #include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
 #include <vector>
 
-#include "drive_fuzz_entry.h"
-#include "pipe_fuzz_entry.h"
-
-// Built once per fuzzing entry.
-#ifndef FUZZ_ENTRY
-#define FUZZ_ENTRY PipeFuzzOneInput
-#endif
+#include "fuzz_support.h"
 
 namespace {
 
@@ -34,14 +29,16 @@ int main(int argc, char** argv) {
   std::size_t runs = 0;
   for (int i = 1; i < argc; ++i) {
     const std::filesystem::path path = argv[i];
+    std::vector<std::filesystem::path> files;
     if (std::filesystem::is_directory(path)) {
       for (const auto& entry : std::filesystem::directory_iterator(path)) {
-        if (!entry.is_regular_file()) continue;
-        if (!RunFile(entry.path())) return 1;
-        ++runs;
+        if (entry.is_regular_file()) files.push_back(entry.path());
       }
     } else {
-      if (!RunFile(path)) return 1;
+      files.push_back(path);
+    }
+    for (const auto& file : files) {
+      if (!RunFile(file)) return 1;
       ++runs;
     }
   }

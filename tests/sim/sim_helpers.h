@@ -15,30 +15,23 @@
 #include "machine.h"
 #include "platform/wide.h"
 #include "platform/win32.h"
+#include "transport/pass_through.h"
 
 namespace simtest {
-
-// The 80-byte pass-through request of the service.
-struct PassThroughRequest {
-  SCSI_PASS_THROUGH_DIRECT sptd;
-  ULONG totalLength;
-  UCHAR sense[20];
-};
-static_assert(sizeof(PassThroughRequest) == 80);
 
 // An INQUIRY of 74 bytes into `data`.
 inline PassThroughRequest Inquiry(std::uint8_t (&data)[74]) {
   PassThroughRequest r{};
-  r.sptd.Length = sizeof(SCSI_PASS_THROUGH_DIRECT);
-  r.sptd.CdbLength = 6;
-  r.sptd.SenseInfoLength = 18;
-  r.sptd.DataIn = SCSI_IOCTL_DATA_IN;
-  r.sptd.DataTransferLength = sizeof data;
-  r.sptd.TimeOutValue = 20;
-  r.sptd.DataBuffer = data;
-  r.sptd.SenseInfoOffset = 60;
-  r.sptd.Cdb[0] = 0x12;
-  r.sptd.Cdb[4] = sizeof data;
+  r.spt.Length = sizeof(SCSI_PASS_THROUGH_DIRECT);
+  r.spt.CdbLength = 6;
+  r.spt.SenseInfoLength = 18;
+  r.spt.DataIn = SCSI_IOCTL_DATA_IN;
+  r.spt.DataTransferLength = sizeof data;
+  r.spt.TimeOutValue = 20;
+  r.spt.DataBuffer = data;
+  r.spt.SenseInfoOffset = 60;
+  r.spt.Cdb[0] = 0x12;
+  r.spt.Cdb[4] = sizeof data;
   r.totalLength = 80;
   return r;
 }
@@ -71,28 +64,22 @@ inline std::vector<Found> ListInterfaces(const GUID& interfaceClass) {
   HDEVINFO list = SetupDiGetClassDevsW(&interfaceClass, nullptr, nullptr,
                                        DIGCF_PRESENT | DIGCF_DEVICEINTERFACE);
   EXPECT_NE(list, INVALID_HANDLE_VALUE);
-  if (list == INVALID_HANDLE_VALUE) return found;
-  for (DWORD index = 0;; ++index) {
-    SP_DEVICE_INTERFACE_DATA data{};
-    data.cbSize = sizeof data;
-    if (!SetupDiEnumDeviceInterfaces(list, nullptr, &interfaceClass, index, &data)) {
-      EXPECT_EQ(GetLastError(), ERROR_NO_MORE_ITEMS);
-      break;
-    }
+  SP_DEVICE_INTERFACE_DATA data{sizeof data, {}, 0, 0};
+  for (DWORD index = 0; SetupDiEnumDeviceInterfaces(list, nullptr, &interfaceClass, index, &data);
+       ++index) {
     DWORD needed = 0;
-    EXPECT_FALSE(SetupDiGetDeviceInterfaceDetailW(list, &data, nullptr, 0, &needed, nullptr));
-    EXPECT_EQ(GetLastError(), ERROR_INSUFFICIENT_BUFFER);
+    SetupDiGetDeviceInterfaceDetailW(list, &data, nullptr, 0, &needed, nullptr);
     std::vector<std::uint8_t> buffer(needed);
     auto* detail = reinterpret_cast<SP_DEVICE_INTERFACE_DETAIL_DATA_W*>(buffer.data());
     detail->cbSize = sizeof(SP_DEVICE_INTERFACE_DETAIL_DATA_W);
-    SP_DEVINFO_DATA info{};
-    info.cbSize = sizeof info;
-    EXPECT_TRUE(SetupDiGetDeviceInterfaceDetailW(list, &data, detail, needed, nullptr, &info));
+    SP_DEVINFO_DATA info{sizeof info, {}, 0, 0};
     WCHAR id[512] = {};
-    EXPECT_TRUE(SetupDiGetDeviceInstanceIdW(list, &info, id, 512, nullptr));
+    EXPECT_TRUE(SetupDiGetDeviceInterfaceDetailW(list, &data, detail, needed, nullptr, &info) &&
+                SetupDiGetDeviceInstanceIdW(list, &info, id, 512, nullptr));
     found.push_back({Text(detail->DevicePath), info.DevInst, Text(id)});
   }
-  EXPECT_TRUE(SetupDiDestroyDeviceInfoList(list));
+  EXPECT_EQ(GetLastError(), ERROR_NO_MORE_ITEMS);
+  SetupDiDestroyDeviceInfoList(list);
   return found;
 }
 

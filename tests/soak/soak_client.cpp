@@ -17,48 +17,42 @@ namespace {
 // block stays sane while the soak runs.
 constexpr DWORD kReady = 102;
 
-bool ExchangeOnce(HANDLE pipe, CommandMessage* request, CommandMessage* reply) {
+bool ExchangeOnce(HANDLE pipe) {
+  static auto request = std::make_unique<CommandMessage>();
+  static auto reply = std::make_unique<CommandMessage>();
+  InitCommand(request.get(), kCommandSetStatus, kReady);
   DWORD got = 0;
-  return ExchangeCommand(pipe, request, sizeof(*request), reply, sizeof(*reply), &got) &&
+  return ExchangeCommand(pipe, request.get(), sizeof(*request), reply.get(), sizeof(*reply),
+                         &got) &&
          got == sizeof(*reply) && reply->command == kCommandSetStatus;
 }
 
 int Stream() {
-  auto request = std::make_unique<CommandMessage>();
-  auto reply = std::make_unique<CommandMessage>();
-  InitCommand(request.get(), kCommandSetStatus, kReady);
   for (;;) {
     HANDLE pipe = OpenCommandPipe(1000);
     if (pipe == INVALID_HANDLE_VALUE) {
       Sleep(10);
       continue;
     }
-    while (ExchangeOnce(pipe, request.get(), reply.get())) {
+    while (ExchangeOnce(pipe)) {
     }
     CloseHandle(pipe);
   }
 }
 
 int Probe(long limitMs) {
-  auto request = std::make_unique<CommandMessage>();
-  auto reply = std::make_unique<CommandMessage>();
-  InitCommand(request.get(), kCommandSetStatus, kReady);
-  auto start = std::chrono::steady_clock::now();
+  const auto start = std::chrono::steady_clock::now();
   HANDLE pipe = OpenCommandPipe(5000);
-  if (pipe == INVALID_HANDLE_VALUE) {
-    std::fprintf(stderr, "probe: cannot open the pipe: %lu\n",
-                 static_cast<unsigned long>(GetLastError()));
-    return 1;
-  }
-  bool ok = ExchangeOnce(pipe, request.get(), reply.get());
-  auto elapsed =
-      std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - start);
-  CloseHandle(pipe);
+  const bool ok = pipe != INVALID_HANDLE_VALUE && ExchangeOnce(pipe);
+  const std::chrono::duration<double, std::milli> elapsed =
+      std::chrono::steady_clock::now() - start;
   if (!ok) {
-    std::fprintf(stderr, "probe: exchange failed: %lu\n",
+    std::fprintf(stderr, "probe: %s failed: %lu\n",
+                 pipe == INVALID_HANDLE_VALUE ? "open" : "exchange",
                  static_cast<unsigned long>(GetLastError()));
     return 1;
   }
+  CloseHandle(pipe);
   std::printf("%.3f\n", elapsed.count());
   return elapsed.count() <= static_cast<double>(limitMs) ? 0 : 3;
 }

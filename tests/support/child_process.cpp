@@ -7,11 +7,8 @@
 #include "test_support.h"
 
 #if !defined(_WIN32)
-#include <errno.h>
-#include <poll.h>
 #include <signal.h>
 #include <spawn.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -25,6 +22,8 @@ const char* ChildRole() {
   return (role != nullptr && *role != '\0') ? role : nullptr;
 }
 
+// Only the host's test programs start children.
+#if !defined(_WIN32)
 namespace {
 
 std::string FilterArgument() {
@@ -40,71 +39,6 @@ bool IsOwnVariable(const std::string& entry) {
 }
 
 }  // namespace
-
-#if defined(_WIN32)
-
-bool ChildProcess::Start(const char* role) {
-  if (Running()) return false;
-  WCHAR path[MAX_PATH];
-  DWORD length = GetModuleFileNameW(nullptr, path, MAX_PATH);
-  if (length == 0 || length >= MAX_PATH) return false;
-
-  WideString commandLine = WSTR("\"");
-  commandLine += path;
-  commandLine += WSTR("\" ");
-  commandLine += Utf8ToWide(FilterArgument());
-
-  // The parent's environment without our own variables, then the child's.
-  std::vector<WCHAR> block;
-  if (LPWCH current = GetEnvironmentStringsW()) {
-    for (LPWCH entry = current; *entry != 0; entry += WideLength(entry) + 1) {
-      if (IsOwnVariable(WideToUtf8(entry))) continue;
-      block.insert(block.end(), entry, entry + WideLength(entry) + 1);
-    }
-    FreeEnvironmentStringsW(current);
-  }
-  for (const std::string& extra :
-       {std::string(kChildRoleVariable) + "=" + role,
-        std::string(kOwnerPidVariable) + "=" + std::to_string(OwnerProcessId())}) {
-    WideString wide = Utf8ToWide(extra);
-    block.insert(block.end(), wide.begin(), wide.end());
-    block.push_back(0);
-  }
-  block.push_back(0);
-
-  STARTUPINFOW startup{};
-  startup.cb = sizeof(startup);
-  PROCESS_INFORMATION info{};
-  if (!CreateProcessW(path, commandLine.data(), nullptr, nullptr, FALSE, CREATE_UNICODE_ENVIRONMENT,
-                      block.data(), nullptr, &startup, &info)) {
-    return false;
-  }
-  CloseHandle(info.hThread);
-  id_ = reinterpret_cast<std::intptr_t>(info.hProcess);
-  return true;
-}
-
-int ChildProcess::Wait(DWORD timeoutMs) {
-  if (!Running()) return -2;
-  HANDLE process = reinterpret_cast<HANDLE>(id_);
-  int result = -1;
-  if (WaitForSingleObject(process, timeoutMs) == WAIT_OBJECT_0) {
-    DWORD code = 0;
-    if (GetExitCodeProcess(process, &code)) result = static_cast<int>(code);
-  } else {
-    TerminateProcess(process, 255);
-    WaitForSingleObject(process, kProcessGuardMs);
-  }
-  CloseHandle(process);
-  id_ = 0;
-  return result;
-}
-
-void ChildProcess::Kill() {
-  if (Running()) TerminateProcess(reinterpret_cast<HANDLE>(id_), 128 + 9);
-}
-
-#else
 
 bool ChildProcess::Start(const char* role) {
   if (Running()) return false;
@@ -132,24 +66,17 @@ bool ChildProcess::Start(const char* role) {
 
 int ChildProcess::Wait(DWORD timeoutMs) {
   if (!Running()) return -2;
-  pid_t pid = static_cast<pid_t>(id_);
+  const pid_t pid = static_cast<pid_t>(id_);
   id_ = 0;
   int status = 0;
-  // A pidfd (the emulation watches its peers the same way) becomes readable
-  // when the child ends, which gives a bounded wait.
-  long pidfd = syscall(SYS_pidfd_open, pid, 0);
-  pollfd entry{static_cast<int>(pidfd), POLLIN, 0};
-  int ready = 0;
-  do {
-    ready =
-        pidfd < 0 ? -1 : poll(&entry, 1, timeoutMs == INFINITE ? -1 : static_cast<int>(timeoutMs));
-  } while (ready < 0 && errno == EINTR);
-  if (pidfd >= 0) close(static_cast<int>(pidfd));
-  bool ended = ready > 0 && waitpid(pid, &status, 0) == pid;
-  if (!ended) {
-    kill(pid, SIGKILL);
-    waitpid(pid, &status, 0);
-    return -1;
+  // Polled in real time; a child that does not end in time is killed.
+  for (DWORD waited = 0; waitpid(pid, &status, WNOHANG) != pid; waited += 2) {
+    if (timeoutMs != INFINITE && waited >= timeoutMs) {
+      kill(pid, SIGKILL);
+      waitpid(pid, &status, 0);
+      return -1;
+    }
+    usleep(2000);
   }
   if (WIFEXITED(status)) return WEXITSTATUS(status);
   if (WIFSIGNALED(status)) return 128 + WTERMSIG(status);
@@ -160,8 +87,6 @@ void ChildProcess::Kill() {
   if (Running()) kill(static_cast<pid_t>(id_), SIGKILL);
 }
 
-#endif
-
 ChildProcess::~ChildProcess() {
   if (Running()) Wait(0);
 }
@@ -171,5 +96,7 @@ int RunChildSelf(const char* role, DWORD timeoutMs) {
   if (!child.Start(role)) return -2;
   return child.Wait(timeoutMs);
 }
+
+#endif
 
 }  // namespace skytest

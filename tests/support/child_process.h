@@ -10,6 +10,7 @@
 //   }
 //
 // The child's exit code is 0 only when exactly that one case ran and passed.
+// Host only: the Windows build declares these but never starts a child.
 #pragma once
 
 #include <cstdint>
@@ -20,7 +21,6 @@
 
 namespace skytest {
 
-// Environment variables set for the child.
 inline constexpr const char* kChildRoleVariable = "SKYVANE_TEST_CHILD";
 inline constexpr const char* kOwnerPidVariable = "SKYVANE_TEST_OWNER_PID";
 
@@ -41,8 +41,7 @@ class ChildProcess {
   // Waits up to `timeoutMs` (real time) for the child to end and returns its
   // exit code; on time-out the child is killed and -1 is returned.
   int Wait(DWORD timeoutMs);
-  // Ends the child at once, as SIGKILL or TerminateProcess does; Wait then
-  // gives 128 + 9 on POSIX.
+  // Ends the child at once; Wait then gives 128 + 9 on POSIX.
   void Kill();
   bool Running() const { return id_ != 0; }
 

@@ -25,8 +25,6 @@ namespace {
 // After every case the emulation must hold no live handle or thread of this
 // process. A thread signals its handle before it has quite unwound, so the
 // counts are polled (real time) for a while; a real leak never reaches zero.
-// Listeners see a case's end in reverse order: appended after the printer,
-// this one runs first and its failure is printed with the case.
 class LeakCheck : public ::testing::EmptyTestEventListener {
  public:
   void OnTestEnd(const ::testing::TestInfo& /*info*/) override {
@@ -53,9 +51,8 @@ bool IsSet(const char* name) {
   return value != nullptr && *value != '\0';
 }
 
-// The registry store goes into a directory of its own, only named here: the
-// emulation creates it on the first registry write, and it goes at exit (also
-// when a case ends the process through exit()).
+// The registry store goes into a directory of its own, created by the
+// emulation on the first write and removed at exit.
 void Isolate() {
   std::random_device random;
   std::string tag = std::to_string(getpid()) + "-" + std::to_string(random() % 1000000);
@@ -82,8 +79,7 @@ int main(int argc, char** argv) {
   ::testing::InitGoogleTest(&argc, argv);
   ::testing::UnitTest::GetInstance()->listeners().Append(new LeakCheck);
   int result = RUN_ALL_TESTS();
-  // A child must have run exactly its one case, and passed it; a filter that
-  // matched nothing must not count as success.
+  // A child must have run exactly its one case and passed it.
   if (skytest::ChildRole() != nullptr && result == 0 &&
       ::testing::UnitTest::GetInstance()->successful_test_count() != 1) {
     result = 3;

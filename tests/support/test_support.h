@@ -14,17 +14,15 @@
 
 namespace skytest {
 
-// Failure guard for Win32 waits in tests: long enough never to fire on a
-// loaded machine, short enough that a hang ends the case instead of the run.
-// The emulation scales wait time-outs by SKYVANE_TIME_SCALE, so the value is
-// divided by that factor to keep the real bound at about ten seconds.
+// Failure guard for Win32 waits in tests: about ten real seconds, so a hang
+// ends the case instead of the run (divided by SKYVANE_TIME_SCALE, which the
+// emulation applies to every wait).
 DWORD ScaledGuardMs();
 inline const DWORD kGuardMs = ScaledGuardMs();
 // Failure guard for waiting on a child process (real time, never scaled).
 constexpr DWORD kProcessGuardMs = 30000;
 
-// Owns one handle and closes it when it goes out of scope. Null and
-// INVALID_HANDLE_VALUE both count as "no handle".
+// Owns one handle and closes it; null and INVALID_HANDLE_VALUE are "none".
 class Handle {
  public:
   Handle() = default;
@@ -87,8 +85,7 @@ class RegKey {
   HKEY key_ = nullptr;
 };
 
-// A thread that runs `body`; its handle is closed, after the thread ended,
-// when the object goes.
+// A thread that runs `body`; the object waits for it to end when it goes.
 class Thread {
  public:
   static constexpr DWORD kNotEnded = 0xFFFFFFF0;
@@ -115,8 +112,8 @@ bool IsWine();
 DWORD OwnerProcessId();
 
 // "<prefix>SkyvaneTest-<owner pid>-<Suite>.<Case>-<tag>": unique per test
-// process and case, so cases may run in parallel (Wine shares named objects
-// across the whole prefix) and a child finds its parent's objects.
+// process and case (Wine shares named objects across the whole prefix), and
+// the same in a child.
 WideString UniqueName(const char* prefix, const char* tag);
 // The same without the prefix, as narrow text (for registry key paths).
 std::string UniqueStem(const char* tag);
