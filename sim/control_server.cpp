@@ -331,6 +331,7 @@ void StartControlServer(Machine* machine) {
 
 void RegisterControlledDefaultMachine() {
   emu::SetDefaultDeviceModelFactory([]() -> emu::DeviceModel* {
+    // Lives as long as the process: device handles may outlive any owner.
     Machine* machine = CreateDefaultMachine().release();
     StartControlServer(machine);
     return machine;

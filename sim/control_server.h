@@ -19,8 +19,8 @@ std::string HandleControlRequest(Machine& machine, const std::vector<std::string
 // until the process ends). The thread is stopped and joined at process exit.
 void StartControlServer(Machine* machine);
 
-// Like RegisterDefaultMachine, and the machine it creates also serves the
-// control channel (used by the host executable).
+// Makes CreateDefaultMachine the emulation's default device model, and the
+// machine it creates serves the control channel (used by the host executable).
 void RegisterControlledDefaultMachine();
 
 }  // namespace sim

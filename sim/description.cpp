@@ -454,11 +454,4 @@ std::unique_ptr<Machine> CreateDefaultMachine() {
   return machine;
 }
 
-void RegisterDefaultMachine() {
-  emu::SetDefaultDeviceModelFactory([]() -> emu::DeviceModel* {
-    // Lives as long as the process: device handles may outlive any owner.
-    return CreateDefaultMachine().release();
-  });
-}
-
 }  // namespace sim

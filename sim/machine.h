@@ -308,8 +308,5 @@ std::string_view DefaultMachineText();
 // embedded default. Never null: a file that cannot be used is reported on
 // standard error and the embedded default is used instead.
 std::unique_ptr<Machine> CreateDefaultMachine();
-// Makes CreateDefaultMachine the emulation's default device model (called by
-// the host executable's registration; tests may call it too).
-void RegisterDefaultMachine();
 
 }  // namespace sim

@@ -1,5 +1,5 @@
-// Linked into the host executable: the default machine, as install_default.cpp
-// gives it, and its control channel served for `skyvane sim`.
+// Linked into the host executable: the default machine (or the description
+// named by SKYVANE_MACHINE), and its control channel served for `skyvane sim`.
 #include "control_server.h"
 
 namespace {
