@@ -28,24 +28,27 @@ std::string PathOf(std::string instanceId, const char* classGuid) {
   return "\\\\?\\" + instanceId + "#" + classGuid;
 }
 
-sim::DriveSpec HidDrive(const std::string& name, const std::string& modelCode,
-                        const std::string& usbSerial) {
-  sim::DriveSpec spec = UsbDrive(name, modelCode, usbSerial);
-  spec.channel = sim::ChannelKind::Hid;
-  spec.hidInstanceId = "HID\\VID_1A2B&PID_" + modelCode + "&MI_01\\7&" + usbSerial + "&0&0000";
+sim::DriveSpec DriverDrive(const std::string& name, const std::string& unitId, int driverClass,
+                           const std::string& controlInstanceId) {
+  sim::DriveSpec spec = FireWireDrive(name, "5E22", unitId);
+  spec.channel = sim::ChannelKind::Driver;
+  spec.driverClass = driverClass;
+  spec.controlInstanceId = controlInstanceId;
+  return spec;
+}
+
+sim::DriveSpec EnclosureDrive(const std::string& name, const std::string& unitId,
+                              int enclosureClass) {
+  sim::DriveSpec spec = FireWireDrive(name, "3C13", unitId);
+  spec.channel = sim::ChannelKind::Enclosure;
+  spec.unitModel = "QUARRY";
+  spec.enclosureClass = enclosureClass;
+  spec.controlInstanceId = "SBP2\\QX&QUARRY_SES&LUN1\\" + unitId;
   return spec;
 }
 
 class ChannelTest : public DiscoveryTest {
  protected:
-  // The stored channel whose device has this instance ID, or null.
-  ChannelRecord* ChannelOf(const std::string& instanceId) {
-    for (LONG i = 0; i < Block().channelCount; ++i) {
-      if (N(Channel(i).deviceInstanceId) == instanceId) return &Channel(i);
-    }
-    return nullptr;
-  }
-
   void Discover() {
     EnumerateDrives(nullptr);
     AssignVolumeLetters();
@@ -53,142 +56,90 @@ class ChannelTest : public DiscoveryTest {
   }
 };
 
-TEST_F(ChannelTest, HidChannelsTakeModeAndCreationFromTheModelLists) {
-  const sim::DriveSpec plain = HidDrive("plain", "2A31", "504C41494E");
-  const sim::DriveSpec standalone = HidDrive("gauge", "7B44", "4741554745");
-  const sim::DriveSpec listed = HidDrive("listed", "5E22", "4C49535445");
-  // The composite device is found whatever language its description is in.
-  machine_.SetLanguage(sim::Language::German);
-  machine_.AddDrive(plain);
-  machine_.SetLanguage(sim::Language::English);
-  machine_.AddDrive(standalone);
-  machine_.SetLanguage(sim::Language::Japanese);
-  machine_.AddDrive(listed);
-  // Someone's mouse: an HID collection of no listed model.
-  const DEVINST mouse =
-      machine_.AddNode(machine_.RootNode(), "HID\\VID_046D&PID_C52B\\8&1&0&0000", "HID mouse");
-  machine_.AddInterface(mouse, emu::kHidInterfaceClass);
-  Install();
-  RebuildChannelTable();
-
-  ASSERT_EQ(Block().channelCount, 3);
-  const ChannelRecord* plainChannel = ChannelOf(plain.hidInstanceId);
-  const ChannelRecord* gaugeChannel = ChannelOf(standalone.hidInstanceId);
-  const ChannelRecord* listedChannel = ChannelOf(listed.hidInstanceId);
-  ASSERT_NE(plainChannel, nullptr);
-  ASSERT_NE(gaugeChannel, nullptr);
-  ASSERT_NE(listedChannel, nullptr);
-
-  EXPECT_EQ(plainChannel->mode, 0u);  // in the model table, not in the channel list
-  EXPECT_EQ(plainChannel->mayCreateDrive, 0u);
-  EXPECT_EQ(gaugeChannel->mode, 1u);
-  EXPECT_EQ(gaugeChannel->mayCreateDrive, 1u);
-  EXPECT_EQ(listedChannel->mode, 1u);
-  EXPECT_EQ(listedChannel->mayCreateDrive, 0u);
-
-  for (LONG i = 0; i < Block().channelCount; ++i) {
-    const ChannelRecord& channel = Channel(i);
-    EXPECT_EQ(channel.kind, 2u);
-    EXPECT_EQ(channel.ownIndex, i);
-    EXPECT_EQ(channel.linkedDrive, -1);
-    EXPECT_EQ(N(channel.devicePath), PathOf(N(channel.deviceInstanceId), kHidGuid));
-    EXPECT_EQ(channel.instanceTail[0], 0);
-    EXPECT_EQ(channel.controlPath[0], 0);
-  }
-  // The serial key is the serial of the composite USB device above.
-  EXPECT_EQ(N(gaugeChannel->serialKey), "4741554745");
-  EXPECT_EQ(N(plainChannel->serialKey), "504C41494E");
-  EXPECT_EQ(N(listedChannel->serialKey), "4C49535445");
-}
-
-TEST_F(ChannelTest, EnclosureIsModeTwoKindThreeUnderAnyVendorClass) {
-  const char* const unitIds[3] = {"0030E0000000E0A1", "0030E0000000E0B2", "0030E0000000E0C3"};
-  const char* const guids[3] = {kClassAGuid, kClassBGuid, kClassCGuid};
-  for (int i = 0; i < 3; ++i) {
-    sim::DriveSpec spec = FireWireDrive("enclosure" + std::to_string(i), "3C13", unitIds[i]);
-    spec.channel = sim::ChannelKind::Enclosure;
-    spec.unitModel = "QUARRY";
-    spec.enclosureClass = i + 1;
-    spec.controlInstanceId = std::string("SBP2\\QX&QUARRY_SES&LUN1\\") + unitIds[i];
-    machine_.AddDrive(spec);
-  }
-  Install();
-  RebuildChannelTable();
-
-  ASSERT_EQ(Block().channelCount, 3);
-  for (int i = 0; i < 3; ++i) {
-    const std::string id = std::string("SBP2\\QX&QUARRY_SES&LUN1\\") + unitIds[i];
-    const ChannelRecord* channel = ChannelOf(id);
-    ASSERT_NE(channel, nullptr) << id;
-    EXPECT_EQ(channel->mode, 2u);
-    EXPECT_EQ(channel->kind, 3u);
-    EXPECT_EQ(channel->mayCreateDrive, 1u);
-    EXPECT_EQ(N(channel->devicePath), PathOf(id, guids[i]));
-    EXPECT_EQ(N(channel->instanceTail), unitIds[i]);
-    EXPECT_EQ(N(channel->serialKey), "000E0300");  // "0030E000" reversed
-    // Only class C interfaces are control interfaces.
-    EXPECT_EQ(N(channel->controlPath), i == 2 ? N(channel->devicePath) : std::string());
-  }
-}
-
-TEST_F(ChannelTest, DriverChannelsFollowTheIeee1394Rules) {
-  sim::DriveSpec controlClass = FireWireDrive("plain", "5E22", "0030E00000000C0C");
-  controlClass.channel = sim::ChannelKind::Driver;
-  controlClass.driverClass = 3;
-  controlClass.controlInstanceId = "1394\\QX&EXTERNAL_HDD&BUTTONS\\0030E00000000C0C";
-  sim::DriveSpec lights = FireWireDrive("lights", "5E22", "0030E00000000D0D");
-  lights.channel = sim::ChannelKind::Driver;
-  lights.driverClass = 1;
-  lights.controlInstanceId = "1394\\QX&LIGHTS\\1A2B3C4D5E";
-  sim::DriveSpec otherVendor = FireWireDrive("other", "5E22", "0030E00000000E0E");
-  otherVendor.channel = sim::ChannelKind::Driver;
-  otherVendor.driverClass = 2;
-  otherVendor.controlInstanceId = "1394\\ACME&DISK\\0030E00000000E0E";
-  sim::DriveSpec unknown = FireWireDrive("unknown", "5E22", "0011220000000F0F");
-  unknown.channel = sim::ChannelKind::Driver;
-  unknown.driverClass = 2;
-  unknown.controlInstanceId = "1394\\ACME&DISK\\0011220000000F0F";
-  machine_.AddDrive(controlClass);
-  machine_.AddDrive(lights);
-  machine_.AddDrive(otherVendor);
-  machine_.AddDrive(unknown);
-  Install();
-  RebuildChannelTable();
-
-  ASSERT_EQ(Block().channelCount, 3);  // the last has neither QX nor a known unit prefix
-  const ChannelRecord* plain = ChannelOf(controlClass.controlInstanceId);
-  const ChannelRecord* lit = ChannelOf(lights.controlInstanceId);
-  const ChannelRecord* other = ChannelOf(otherVendor.controlInstanceId);
-  ASSERT_NE(plain, nullptr);
-  ASSERT_NE(lit, nullptr);
-  ASSERT_NE(other, nullptr);
-
-  EXPECT_EQ(plain->kind, 0u);  // class C keeps the kind of its rule
-  EXPECT_EQ(plain->mode, 0u);
-  EXPECT_EQ(N(plain->controlPath), PathOf(controlClass.controlInstanceId, kClassCGuid));
-  EXPECT_EQ(lit->kind, 3u);
-  EXPECT_EQ(lit->mode, 1u);
-  EXPECT_EQ(lit->controlPath[0], 0);
-  EXPECT_EQ(N(lit->serialKey), "A1000000");  // "0000001A2B3C4D5E", first eight reversed
-  EXPECT_EQ(other->kind, 3u);
-  EXPECT_EQ(other->mode, 1u);
-  for (const ChannelRecord* channel : {plain, lit, other}) EXPECT_EQ(channel->mayCreateDrive, 1u);
-}
-
-TEST_F(ChannelTest, RebuildClearsEveryRecordButItsReadyEvent) {
+TEST_F(ChannelTest, ScanClassifiesEachInterfaceAndClearsEveryOtherRecord) {
   for (int i = 0; i < kMaxChannels; ++i) {
     std::memset(&Channel(i), 0x5A, sizeof(ChannelRecord));
     Channel(i).readyEvent = reinterpret_cast<HANDLE>(static_cast<std::uintptr_t>(0x1000 + i));
   }
-  Block().channelCount = 17;
+  // The composite device is found whatever language its description is in.
+  machine_.SetLanguage(sim::Language::German);
+  machine_.AddDrive(HidDrive("plain", "2A31", "504C41494E"));
+  machine_.SetLanguage(sim::Language::English);
+  machine_.AddDrive(HidDrive("gauge", "7B44", "4741554745"));
+  machine_.SetLanguage(sim::Language::Japanese);
+  machine_.AddDrive(HidDrive("listed", "5E22", "4C49535445"));
+  machine_.SetLanguage(sim::Language::English);
+  // Someone's mouse: an HID collection of no listed model.
+  const DEVINST mouse =
+      machine_.AddNode(machine_.RootNode(), "HID\\VID_046D&PID_C52B\\8&1&0&0000", "HID mouse");
+  machine_.AddInterface(mouse, emu::kHidInterfaceClass);
+  machine_.AddDrive(EnclosureDrive("sesA", "0030E0000000E0A1", 1));
+  machine_.AddDrive(EnclosureDrive("sesB", "0030E0000000E0B2", 2));
+  machine_.AddDrive(EnclosureDrive("sesC", "0030E0000000E0C3", 3));
+  machine_.AddDrive(DriverDrive("buttons", "0030E00000000C0C", 3,
+                                "1394\\QX&EXTERNAL_HDD&BUTTONS\\0030E00000000C0C"));
+  machine_.AddDrive(DriverDrive("lights", "0030E00000000D0D", 1, "1394\\QX&LIGHTS\\1A2B3C4D5E"));
+  machine_.AddDrive(
+      DriverDrive("other", "0030E00000000E0E", 2, "1394\\ACME&DISK\\0030E00000000E0E"));
+  // Neither QX nor a known unit prefix: no channel.
+  machine_.AddDrive(
+      DriverDrive("unknown", "0011220000000F0F", 2, "1394\\ACME&DISK\\0011220000000F0F"));
   Install();
+  RebuildChannelTable();
 
-  EXPECT_EQ(RebuildChannelTable(), -1);
-  EXPECT_EQ(Block().channelCount, 0);
+  const struct {
+    std::string id;
+    const char* guid;
+    DWORD kind, mode, mayCreate;
+    std::string tail, serialKey;
+    bool control;
+  } rows[] = {
+      // HID mode and creation follow the two model lists; the key is the
+      // serial of the composite USB device above.
+      {"HID\\VID_1A2B&PID_2A31&MI_01\\7&504C41494E&0&0000", kHidGuid, 2, 0, 0, "", "504C41494E",
+       false},
+      {"HID\\VID_1A2B&PID_7B44&MI_01\\7&4741554745&0&0000", kHidGuid, 2, 1, 1, "", "4741554745",
+       false},
+      {"HID\\VID_1A2B&PID_5E22&MI_01\\7&4C49535445&0&0000", kHidGuid, 2, 1, 0, "", "4C49535445",
+       false},
+      // Enclosures under any vendor class; only class C is a control interface.
+      {"SBP2\\QX&QUARRY_SES&LUN1\\0030E0000000E0A1", kClassAGuid, 3, 2, 1, "0030E0000000E0A1",
+       "000E0300", false},
+      {"SBP2\\QX&QUARRY_SES&LUN1\\0030E0000000E0B2", kClassBGuid, 3, 2, 1, "0030E0000000E0B2",
+       "000E0300", false},
+      {"SBP2\\QX&QUARRY_SES&LUN1\\0030E0000000E0C3", kClassCGuid, 3, 2, 1, "0030E0000000E0C3",
+       "000E0300", true},
+      // Driver channels: class C keeps the kind of its rule (0).
+      {"1394\\QX&EXTERNAL_HDD&BUTTONS\\0030E00000000C0C", kClassCGuid, 0, 0, 1, "0030E00000000C0C",
+       "000E0300", true},
+      {"1394\\QX&LIGHTS\\1A2B3C4D5E", kClassAGuid, 3, 1, 1, "1A2B3C4D5E", "A1000000", false},
+      {"1394\\ACME&DISK\\0030E00000000E0E", kClassBGuid, 3, 1, 1, "0030E00000000E0E", "000E0300",
+       false},
+  };
+  ASSERT_EQ(Block().channelCount, 9);
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.id);
+    const ChannelRecord* channel = ChannelOf(row.id);
+    ASSERT_NE(channel, nullptr);
+    EXPECT_EQ(channel->kind, row.kind);
+    EXPECT_EQ(channel->mode, row.mode);
+    EXPECT_EQ(channel->mayCreateDrive, row.mayCreate);
+    EXPECT_EQ(channel->linkedDrive, -1);
+    EXPECT_EQ(N(channel->devicePath), PathOf(row.id, row.guid));
+    EXPECT_EQ(N(channel->instanceTail), row.tail);
+    EXPECT_EQ(N(channel->serialKey), row.serialKey);
+    EXPECT_EQ(N(channel->controlPath), row.control ? PathOf(row.id, row.guid) : "");
+  }
   for (int i = 0; i < kMaxChannels; ++i) {
+    const HANDLE ready = reinterpret_cast<HANDLE>(static_cast<std::uintptr_t>(0x1000 + i));
+    EXPECT_EQ(Channel(i).readyEvent, ready) << i;
+    if (i < 9) {
+      EXPECT_EQ(Channel(i).ownIndex, i);
+      continue;
+    }
     ChannelRecord expected{};
     expected.linkedDrive = -1;
-    expected.readyEvent = reinterpret_cast<HANDLE>(static_cast<std::uintptr_t>(0x1000 + i));
+    expected.readyEvent = ready;
     EXPECT_EQ(std::memcmp(&Channel(i), &expected, sizeof(expected)), 0) << i;
   }
 }
@@ -198,13 +149,9 @@ TEST_F(ChannelTest, BindingLinksTheChannelsOfEachKindToTheirDrives) {
   sim::VolumeSpec volume;
   volume.letter = 'E';
   usb.volumes = {volume};
-  sim::DriveSpec enclosure = FireWireDrive("enclosure", "3C13", "0030E00000045D6F");
-  enclosure.channel = sim::ChannelKind::Enclosure;
-  enclosure.controlInstanceId = "SBP2\\QX&QUARRY_SES&LUN1\\0030E00000045D6F";
-  sim::DriveSpec fireWire = FireWireDrive("firewire", "5E22", "0030E0000001A2B3");
-  fireWire.channel = sim::ChannelKind::Driver;
-  fireWire.driverClass = 1;
-  fireWire.controlInstanceId = "1394\\QX&EXTERNAL_HDD&FILTER\\0030E0000001A2B3";
+  const sim::DriveSpec enclosure = EnclosureDrive("enclosure", "0030E00000045D6F", 3);
+  const sim::DriveSpec fireWire = DriverDrive("firewire", "0030E0000001A2B3", 1,
+                                              "1394\\QX&EXTERNAL_HDD&FILTER\\0030E0000001A2B3");
   machine_.AddDrive(usb);
   machine_.AddDrive(enclosure);
   machine_.AddDrive(fireWire);
@@ -249,8 +196,7 @@ TEST_F(ChannelTest, BindingLinksTheChannelsOfEachKindToTheirDrives) {
 }
 
 TEST_F(ChannelTest, AChannelWithoutDiskMakesOneRecordHoweverOftenItBinds) {
-  const sim::DriveSpec usb = HidDrive("usb", "7B44", "2D41");
-  machine_.AddDrive(usb);
+  machine_.AddDrive(HidDrive("usb", "7B44", "2D41"));
   machine_.FailOpen("usb", sim::Endpoint::Disk, ERROR_ACCESS_DENIED);
   Install();
   Discover();
@@ -270,12 +216,10 @@ TEST_F(ChannelTest, AChannelWithoutDiskMakesOneRecordHoweverOftenItBinds) {
     EXPECT_EQ(Block().driveCount, 1) << round;
   }
   const DriveRecord& drive = Drive(0);
-  EXPECT_EQ(drive.recordIndex, 0);
   EXPECT_EQ(drive.fromChannel, 1u);
   EXPECT_EQ(drive.extendedIdentity, 1u);
   EXPECT_EQ(drive.busKind, 2u);
   EXPECT_EQ(drive.channelMode, 1u);
-  EXPECT_EQ(drive.channelIndex, 0);
   EXPECT_EQ(N(drive.model), "QX USB HDD");
   EXPECT_EQ(N(drive.serialNumber), "-A");
   EXPECT_EQ(N(drive.hidPath), N(channel.devicePath));
@@ -289,34 +233,20 @@ TEST_F(ChannelTest, AChannelWithoutDiskMakesOneRecordHoweverOftenItBinds) {
 // Records and channels written directly, for the matching rules alone.
 class BindingRulesTest : public DiscoveryTest {
  protected:
-  ChannelRecord MakeChannel(DWORD kind, DWORD mode) {
+  ChannelRecord MakeChannel(DWORD kind, DWORD mode, const WCHAR* identity = nullptr) {
     ChannelRecord channel{};
     channel.kind = kind;
     channel.mode = mode;
     channel.linkedDrive = -1;
     channel.ownIndex = 5;
     WideCopy(channel.devicePath, 256, WSTR("\\\\?\\channel#5"));
+    if (identity != nullptr) {
+      channel.mayCreateDrive = 1;
+      WideCopy(channel.identityText, 128, identity);
+    }
     return channel;
   }
 };
-
-TEST_F(BindingRulesTest, DriverChannelMatchesOnlyThroughItsKeys) {
-  Block().driveCount = 1;
-  WideCopy(Drive(0).parentDeviceId, 256, WSTR("1394\\QX&EXTERNAL_HDD\\0030E0000001A2B3"));
-  WideCopy(Drive(0).instanceKey, 128, WSTR("ABCDEF0123456789&0"));
-
-  ChannelRecord noKeys = MakeChannel(3, 0);
-  WideCopy(noKeys.serialKey, 128, WSTR("ABCDEF012345678"));  // 15 units: too short
-  EXPECT_EQ(BindChannelToDrive(&noKeys, nullptr, 1), -1);
-
-  ChannelRecord longKey = MakeChannel(3, 0);
-  WideCopy(longKey.serialKey, 128, WSTR("ABCDEF0123456789"));
-  EXPECT_EQ(BindChannelToDrive(&longKey, nullptr, 1), 0);
-
-  ChannelRecord controlKind = MakeChannel(0, 0);  // kind 0 has no matching rule
-  WideCopy(controlKind.instanceTail, 256, WSTR("0030E0000001A2B3"));
-  EXPECT_EQ(BindChannelToDrive(&controlKind, nullptr, 0), -1);
-}
 
 TEST_F(BindingRulesTest, KeysMatchWholeComponentsOnly) {
   // Drive 0's IDs carry the short keys inside longer components.
@@ -336,41 +266,30 @@ TEST_F(BindingRulesTest, KeysMatchWholeComponentsOnly) {
   ChannelRecord enclosure = MakeChannel(3, 2);
   WideCopy(enclosure.instanceTail, 256, WSTR("5"));
   EXPECT_EQ(BindChannelToDrive(&enclosure, nullptr, 0), 1);
+  ChannelRecord controlKind = MakeChannel(0, 0);  // kind 0 has no matching rule
+  WideCopy(controlKind.instanceTail, 256, WSTR("5"));
+  EXPECT_EQ(BindChannelToDrive(&controlKind, nullptr, 0), -1);
 
   // Without the drive that carries the key as a whole, nothing matches.
   Block().driveCount = 1;
   for (ChannelRecord* channel : {&hid, &driver, &enclosure}) {
     EXPECT_EQ(BindChannelToDrive(channel, nullptr, 0), -1);
   }
+
+  // A driver channel's serial key matches a drive's instance key from 16 units on.
+  WideCopy(Drive(0).instanceKey, 128, WSTR("ABCDEF0123456789&0"));
+  ChannelRecord shortKey = MakeChannel(3, 0);
+  WideCopy(shortKey.serialKey, 128, WSTR("ABCDEF012345678"));
+  EXPECT_EQ(BindChannelToDrive(&shortKey, nullptr, 1), -1);
+  ChannelRecord longKey = MakeChannel(3, 0);
+  WideCopy(longKey.serialKey, 128, WSTR("ABCDEF0123456789"));
+  EXPECT_EQ(BindChannelToDrive(&longKey, nullptr, 1), 0);
 }
 
-TEST_F(BindingRulesTest, CreatedRecordsReplaceTheScratchCandidateAndStopAt64) {
-  Block().driveCount = 63;
-  WideCopy(Drive(63).diskPath, 256, WSTR("\\\\?\\scratch#disk"));
-  Drive(63).lastLba = 12345;
-
-  ChannelRecord usb = MakeChannel(2, 1);
-  usb.mayCreateDrive = 1;
-  WideCopy(usb.identityText, 128, WSTR("41427"));  // the unpaired digit is ignored
-  ASSERT_EQ(BindChannelToDrive(&usb, nullptr, 1), 63);
-  EXPECT_EQ(Block().driveCount, 64);
-  EXPECT_EQ(N(Drive(63).serialNumber), "AB");
-  EXPECT_EQ(Drive(63).diskPath[0], 0);
-  EXPECT_EQ(Drive(63).lastLba, 0u);
-
-  ChannelRecord fireWire = MakeChannel(3, 0);
-  fireWire.mayCreateDrive = 1;
-  WideCopy(fireWire.devicePath, 256, WSTR("\\\\?\\channel#6"));
-  WideCopy(fireWire.identityText, 128, WSTR("0030E0000001A2B3"));
-  EXPECT_EQ(BindChannelToDrive(&fireWire, nullptr, 1), -1);  // no slot left
-  EXPECT_EQ(Block().driveCount, 64);
-}
-
-TEST_F(BindingRulesTest, ChannelsWithoutAPathNeverShareARecord) {
-  ChannelRecord first = MakeChannel(2, 1);
-  first.mayCreateDrive = 1;
+TEST_F(BindingRulesTest, CreatedRecordsNeverShareASlotAndStopAt64) {
+  // Channels without a path are never taken for the same channel.
+  ChannelRecord first = MakeChannel(2, 1, WSTR("4142"));
   first.devicePath[0] = 0;
-  WideCopy(first.identityText, 128, WSTR("4142"));
   ASSERT_EQ(BindChannelToDrive(&first, nullptr, 1), 0);
   ChannelRecord second = first;
   second.ownIndex = 6;
@@ -379,18 +298,32 @@ TEST_F(BindingRulesTest, ChannelsWithoutAPathNeverShareARecord) {
   EXPECT_EQ(BindChannelToDrive(&second, nullptr, 1), 1);
   EXPECT_EQ(N(Drive(0).serialNumber), "AB");
   EXPECT_EQ(N(Drive(1).serialNumber), "CD");
-}
 
-TEST_F(BindingRulesTest, FireWireChannelRecordKeepsItsIdentityText) {
-  ChannelRecord fireWire = MakeChannel(3, 1);
-  fireWire.mayCreateDrive = 1;
-  WideCopy(fireWire.identityText, 128, WSTR("0030E0000001A2B3"));
+  // An IEEE 1394 record keeps the identity text as its serial.
+  ChannelRecord fireWire = MakeChannel(3, 1, WSTR("0030E0000001A2B3"));
   WideCopy(fireWire.controlPath, 256, WSTR("\\\\?\\control#c"));
-  ASSERT_EQ(BindChannelToDrive(&fireWire, nullptr, 1), 0);
-  EXPECT_EQ(N(Drive(0).model), "QX 1394 HDD");
-  EXPECT_EQ(N(Drive(0).serialNumber), "0030E0000001A2B3");
-  EXPECT_EQ(N(Drive(0).controlPath), "\\\\?\\control#c");
-  EXPECT_EQ(Drive(0).busKind, 3u);
+  ASSERT_EQ(BindChannelToDrive(&fireWire, nullptr, 1), 2);
+  EXPECT_EQ(N(Drive(2).model), "QX 1394 HDD");
+  EXPECT_EQ(N(Drive(2).serialNumber), "0030E0000001A2B3");
+  EXPECT_EQ(N(Drive(2).controlPath), "\\\\?\\control#c");
+  EXPECT_EQ(Drive(2).busKind, 3u);
+  EXPECT_EQ(Drive(2).recordIndex, 2);
+
+  // The 64th slot holds the enumeration's scratch candidate: replaced whole.
+  Block().driveCount = 63;
+  WideCopy(Drive(63).diskPath, 256, WSTR("\\\\?\\scratch#disk"));
+  Drive(63).lastLba = 12345;
+  ChannelRecord usb = MakeChannel(2, 1, WSTR("41427"));  // the unpaired digit is ignored
+  WideCopy(usb.devicePath, 256, WSTR("\\\\?\\channel#7"));
+  ASSERT_EQ(BindChannelToDrive(&usb, nullptr, 1), 63);
+  EXPECT_EQ(Block().driveCount, 64);
+  EXPECT_EQ(N(Drive(63).serialNumber), "AB");
+  EXPECT_EQ(Drive(63).diskPath[0], 0);
+  EXPECT_EQ(Drive(63).lastLba, 0u);
+  ChannelRecord late = MakeChannel(3, 0, WSTR("0030E0000009A2B3"));
+  WideCopy(late.devicePath, 256, WSTR("\\\\?\\channel#8"));
+  EXPECT_EQ(BindChannelToDrive(&late, nullptr, 1), -1);  // no slot left
+  EXPECT_EQ(Block().driveCount, 64);
 }
 
 }  // namespace

@@ -1,6 +1,4 @@
-// A working state block and a simulated computer for the discovery tests:
-// each case builds its machine, installs it and runs the discovery passes
-// against it.
+// A working state block and a simulated computer for the discovery tests.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -41,6 +39,14 @@ inline sim::DriveSpec UsbDrive(const std::string& name, const std::string& model
   return spec;
 }
 
+inline sim::DriveSpec HidDrive(const std::string& name, const std::string& modelCode,
+                               const std::string& usbSerial) {
+  sim::DriveSpec spec = UsbDrive(name, modelCode, usbSerial);
+  spec.channel = sim::ChannelKind::Hid;
+  spec.hidInstanceId = "HID\\VID_1A2B&PID_" + modelCode + "&MI_01\\7&" + usbSerial + "&0&0000";
+  return spec;
+}
+
 // An IEEE 1394 drive of the maker, identifiers spelled out likewise.
 inline sim::DriveSpec FireWireDrive(const std::string& name, const std::string& modelCode,
                                     const std::string& unitId) {
@@ -77,6 +83,14 @@ class DiscoveryTest : public ::testing::Test {
   void Install() {
     machine_.Install();
     installed_ = true;
+  }
+
+  // The stored channel whose device has this instance ID, or null.
+  ChannelRecord* ChannelOf(const std::string& instanceId) {
+    for (LONG i = 0; i < Block().channelCount; ++i) {
+      if (N(Channel(i).deviceInstanceId) == instanceId) return &Channel(i);
+    }
+    return nullptr;
   }
 
   StateBlock& Block() { return *block_; }
