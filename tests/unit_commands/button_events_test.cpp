@@ -57,26 +57,27 @@ TEST_F(ButtonEventTest, EachChannelKindDeliversItsEventByte) {
   EXPECT_EQ(Sent("firewire", Kind::Control).at(0).code, CTL_WAIT_EVENT);
 }
 
-TEST_F(ButtonEventTest, StopCancelsAPendingWait) {
+TEST_F(ButtonEventTest, AWaitEndsOnAStopOrWithTheErrorOfAVanishedDevice) {
   const auto stop = [&] { SetEvent(monitorState.workerStopEvent); };
-  const EventResult driver = WaitThen(FireWire(), "firewire", sim::Endpoint::Driver, stop);
-  EXPECT_EQ(driver.event, kNoButtonEvent);
-  EXPECT_EQ(driver.error, static_cast<DWORD>(ERROR_IO_PENDING));
-  EXPECT_EQ(machine_.PendingCount("firewire", sim::Endpoint::Driver), 0u);
-
-  ResetEvent(monitorState.workerStopEvent);
-  const EventResult hid = WaitThen(Gauge(), "gauge", sim::Endpoint::Hid, stop);
-  EXPECT_EQ(hid.event, kNoButtonEvent);
-  EXPECT_EQ(hid.error, static_cast<DWORD>(ERROR_IO_PENDING));
-  EXPECT_EQ(machine_.PendingCount("gauge", sim::Endpoint::Hid), 0u);
+  const struct {
+    ChannelRecord* channel;
+    const char* drive;
+    sim::Endpoint endpoint;
+  } waits[] = {{FireWire(), "firewire", sim::Endpoint::Driver},
+               {Gauge(), "gauge", sim::Endpoint::Hid}};
+  for (const auto& wait : waits) {
+    ResetEvent(monitorState.workerStopEvent);
+    const EventResult stopped = WaitThen(wait.channel, wait.drive, wait.endpoint, stop);
+    EXPECT_EQ(stopped.event, kNoButtonEvent) << wait.drive;
+    EXPECT_EQ(stopped.error, static_cast<DWORD>(ERROR_IO_PENDING)) << wait.drive;
+    EXPECT_EQ(machine_.PendingCount(wait.drive, wait.endpoint), 0u) << wait.drive;
+  }
   // A press after the stop is kept for the next wait, not lost in a
   // cancelled one.
   ResetEvent(monitorState.workerStopEvent);
   machine_.Press("firewire", 0x01);
   EXPECT_EQ(ReadButtonEvent(FireWire()), 0x01);
-}
 
-TEST_F(ButtonEventTest, VanishedDeviceEndsTheWaitWithItsError) {
   const EventResult gone = WaitThen(FireWire(), "firewire", sim::Endpoint::Driver,
                                     [&] { machine_.Detach("firewire", ERROR_DEV_NOT_EXIST); });
   EXPECT_EQ(gone.event, kNoButtonEvent);
@@ -115,30 +116,6 @@ TEST_F(ButtonEventTest, StaleDriveListIsReadAgainBeforeTheEventIsTaken) {
   EXPECT_EQ(Block().driveCount, 0);
 }
 
-TEST_F(ButtonEventTest, DriverIdentityIsWrittenAsHexadecimalWithinTheLength) {
-  ChannelRecord* fireWire = FireWire();
-  WCHAR buffer[20];
-  const auto fill = [&] {
-    for (WCHAR& unit : buffer) unit = WSTR('#');
-  };
-  fill();
-  EXPECT_EQ(ReadDriveIdentity(fireWire, reinterpret_cast<BYTE*>(buffer), 34), 0u);
-  EXPECT_EQ(Narrow(buffer), "1122334455667788");  // bytes 88 77 66 55 44 33 22 11
-  EXPECT_EQ(fireWire->identityText[0], 0) << "the record's identity is not written";
-
-  fill();
-  EXPECT_EQ(ReadDriveIdentity(fireWire, reinterpret_cast<BYTE*>(buffer), 10), 0u);
-  EXPECT_EQ(Narrow(buffer), "1122");
-  EXPECT_EQ(buffer[5], WSTR('#'));
-
-  fill();
-  EXPECT_EQ(DriveCommand(fireWire, CTL_GET_IDENTITY, reinterpret_cast<BYTE*>(buffer), 1, nullptr),
-            0u);
-  EXPECT_EQ(buffer[0], WSTR('#')) << "a length of 1 writes nothing";
-  EXPECT_EQ(ReadDriveIdentity(Enclosure(), reinterpret_cast<BYTE*>(buffer), 40), 0u);
-  EXPECT_EQ(buffer[0], WSTR('#'));
-}
-
 // Workers read identities while the monitor rebuilds the records: the HID
 // identity is stored, and the driver channel's handle read, under the mutex.
 TEST_F(ButtonEventTest, IdentityReadsWaitForTheStateMutex) {
@@ -153,10 +130,30 @@ TEST_F(ButtonEventTest, IdentityReadsWaitForTheStateMutex) {
   EXPECT_EQ(Narrow(buffer), "1122334455667788");
 }
 
-TEST_F(ButtonEventTest, HidIdentityIsTheSerialStringWhateverTheLength) {
-  ChannelRecord* gauge = Gauge();
+TEST_F(ButtonEventTest, IdentityIsHexadecimalTextWithinTheLengthAsked) {
+  // The driver's 8 identity bytes 88 77 ... 11, within the length given.
+  ChannelRecord* fireWire = FireWire();
   WCHAR buffer[128];
-  for (WCHAR& unit : buffer) unit = WSTR('#');
+  const auto fill = [&] {
+    for (WCHAR& unit : buffer) unit = WSTR('#');
+  };
+  fill();
+  EXPECT_EQ(ReadDriveIdentity(fireWire, reinterpret_cast<BYTE*>(buffer), 34), 0u);
+  EXPECT_EQ(Narrow(buffer), "1122334455667788");
+  EXPECT_EQ(fireWire->identityText[0], 0) << "the record's identity is not written";
+  fill();
+  EXPECT_EQ(ReadDriveIdentity(fireWire, reinterpret_cast<BYTE*>(buffer), 10), 0u);
+  EXPECT_EQ(Narrow(buffer), "1122");
+  EXPECT_EQ(buffer[5], WSTR('#'));
+  fill();
+  EXPECT_EQ(DriveCommand(fireWire, CTL_GET_IDENTITY, reinterpret_cast<BYTE*>(buffer), 1, nullptr),
+            0u);
+  EXPECT_EQ(buffer[0], WSTR('#')) << "a length of 1 writes nothing";
+  EXPECT_EQ(ReadDriveIdentity(Enclosure(), reinterpret_cast<BYTE*>(buffer), 40), 0u);
+  EXPECT_EQ(buffer[0], WSTR('#'));
+
+  // The HID serial string, whatever the length, also into the record.
+  ChannelRecord* gauge = Gauge();
   EXPECT_EQ(DriveCommand(gauge, CTL_GET_IDENTITY, reinterpret_cast<BYTE*>(buffer), 1, nullptr), 1u);
   EXPECT_EQ(Narrow(buffer), "374B324139463331");  // "7K2A9F31" as hexadecimal pairs
   EXPECT_EQ(Narrow(gauge->identityText), "374B324139463331");

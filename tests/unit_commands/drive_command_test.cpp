@@ -15,42 +15,36 @@ using Kind = sim::Command::Kind;
 
 class DriveCommandTest : public CommandTest {};
 
-TEST_F(DriveCommandTest, GaugeHidChannelTranslatesValuesAfterTheZeroTest) {
+TEST_F(DriveCommandTest, HidChannelsWriteTheReportTheirModelAsksFor) {
+  // Models with flag 0x10 (7B44, and 5E24 found through the lower-case
+  // interface path) send 5-byte reports with ID 1 and translate gauge and
+  // state values; a plain channel sends the value untranslated.
   ChannelRecord* gauge = Gauge();
   EXPECT_EQ(SendDriveCommand(gauge, CTL_SET_GAUGE, 8, nullptr), 1u);
   EXPECT_EQ(SendDriveCommand(gauge, CTL_SET_GAUGE, 0x8100, nullptr), 1u);
   EXPECT_EQ(SendDriveCommand(gauge, CTL_SET_STATE, 2, nullptr), 1u);   // becomes 0, still sent
   EXPECT_EQ(SendDriveCommand(gauge, CTL_SET_STATE, 16, nullptr), 1u);  // becomes 4
-  // Model 7B44 carries flag 0x10: 5-byte reports with ID 1.
+  EXPECT_EQ(SendDriveCommand(Wide(), CTL_SET_GAUGE, 0x8100, nullptr), 1u);
+  BYTE reply = 0x40;
+  EXPECT_EQ(DriveCommand(Plain(), CTL_EVENT_REPLY, &reply, 1, nullptr), 1u);
   EXPECT_EQ(HidReports("gauge"), (std::vector<Bytes>{
                                      {0x01, 0x02, 0x00, 0x00, 0x00},
                                      {0x01, 0x00, 0x81, 0x00, 0x00},
                                      {0x01, 0x00, 0x00, 0x00, 0x00},
                                      {0x01, 0x04, 0x00, 0x00, 0x00},
                                  }));
-}
-
-TEST_F(DriveCommandTest, HidValueZeroSucceedsWithoutOpeningAnything) {
-  machine_.FailOpen("gauge", sim::Endpoint::Hid, ERROR_ACCESS_DENIED, 1);
-  EXPECT_EQ(SendDriveCommand(Gauge(), CTL_SET_GAUGE, 0, nullptr), 1u);
-  EXPECT_TRUE(HidReports("gauge").empty());
-  // The open failure is still armed: the next real command meets it.
-  EXPECT_EQ(SendDriveCommand(Gauge(), CTL_SET_GAUGE, 0x8300, nullptr), 0u);
-  EXPECT_TRUE(HidReports("gauge").empty());
-  EXPECT_EQ(SendDriveCommand(Gauge(), CTL_SET_GAUGE, 0x8300, nullptr), 1u);
-  EXPECT_EQ(HidReports("gauge").size(), 1u);
-}
-
-TEST_F(DriveCommandTest, ReportIdFollowsTheModelRowOfTheInterfacePath) {
-  // The interface path, in lower case as the system lists it, finds the row
-  // of model 5E24, whose flag asks for the 5-byte report with ID 1.
-  ChannelRecord* wide = Wide();
-  EXPECT_EQ(SendDriveCommand(wide, CTL_SET_GAUGE, 0x8100, nullptr), 1u);
-  // A plain channel sends the value untranslated.
-  BYTE reply = 0x40;
-  EXPECT_EQ(DriveCommand(Plain(), CTL_EVENT_REPLY, &reply, 1, nullptr), 1u);
   EXPECT_EQ(HidReports("wide"), (std::vector<Bytes>{{0x01, 0x00, 0x81, 0x00, 0x00}}));
   EXPECT_EQ(HidReports("plain"), (std::vector<Bytes>{{0x00, 0x40, 0x00}}));
+
+  // Value 0 succeeds without opening anything: an armed open failure is met
+  // by the next real command.
+  machine_.ClearCommands();
+  machine_.FailOpen("gauge", sim::Endpoint::Hid, ERROR_ACCESS_DENIED, 1);
+  EXPECT_EQ(SendDriveCommand(gauge, CTL_SET_GAUGE, 0, nullptr), 1u);
+  EXPECT_EQ(SendDriveCommand(gauge, CTL_SET_GAUGE, 0x8300, nullptr), 0u);
+  EXPECT_TRUE(HidReports("gauge").empty());
+  EXPECT_EQ(SendDriveCommand(gauge, CTL_SET_GAUGE, 0x8300, nullptr), 1u);
+  EXPECT_EQ(HidReports("gauge").size(), 1u);
 }
 
 TEST_F(DriveCommandTest, DriverControlsCarryTheValueOnlyForCodesWithInput) {
@@ -178,22 +172,6 @@ TEST_F(DriveCommandTest, DispatcherRejectsCodesItDoesNotAccept) {
   EXPECT_EQ(DriveCommand(FireWire(), 0x222044, &value, 1, nullptr), 0u);
   EXPECT_EQ(DriveCommand(FireWire(), 0x223C2C, &value, 1, nullptr), 0u);
   EXPECT_TRUE(machine_.Commands().empty()) << machine_.Transcript();
-}
-
-TEST_F(DriveCommandTest, EventWaitCodesReturnTheEventByteInTheBuffer) {
-  machine_.Press("firewire", 0x05);
-  BYTE buffer[4] = {0xAA, 0xAA, 0xAA, 0xAA};
-  EXPECT_EQ(DriveCommand(FireWire(), CTL_WAIT_EVENT, buffer, 4, nullptr), 1u);
-  EXPECT_EQ(buffer[0], 0x05);
-  EXPECT_EQ(buffer[1], 0xAA);
-  machine_.Press("lights", 0x02);
-  EXPECT_EQ(DriveCommand(Lights(), CTL_WAIT_GAUGE_EVENT, buffer, 4, nullptr), 1u);
-  EXPECT_EQ(buffer[0], 0x02);
-  // The wait control follows the channel's mode, not the code asked for.
-  const std::vector<sim::Command> waits = Sent("lights", Kind::Control);
-  ASSERT_EQ(waits.size(), 1u);
-  EXPECT_EQ(waits[0].code, CTL_WAIT_GAUGE_EVENT);
-  EXPECT_EQ(Sent("firewire", Kind::Control).at(0).code, CTL_WAIT_EVENT);
 }
 
 }  // namespace

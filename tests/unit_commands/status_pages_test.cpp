@@ -47,10 +47,28 @@ TEST_F(StatusPagesTest, HidStatusReportIsPresentedAsTheStatusPage) {
   EXPECT_EQ(ReadDriveStatus(&drive, page), 4u);
   EXPECT_EQ(page[4], 0x0A) << "bits 4 and 5 are cleared on the HID path";
 
+  // The sleep report (ID 3) is presented as page 0x83.
+  machine_.SetSleepState("gauge", 6);
+  EXPECT_EQ(ReadSleepState(&drive, page), 2u);
+  EXPECT_EQ(Page(page, 5), (Bytes{0x83, 0x00, 0x00, 0x00, 0x80}));
+  machine_.SetSleepState("gauge", 1);
+  EXPECT_EQ(ReadSleepState(&drive, page), 0u);
+  EXPECT_EQ(page[4], 0x40);
+  machine_.SetSleepState("gauge", 3);
+  EXPECT_EQ(ReadSleepState(&drive, page), 3u);
+
   const std::vector<sim::Command> queries = Sent("gauge", Kind::HidInputReport);
-  ASSERT_EQ(queries.size(), 2u);
+  ASSERT_EQ(queries.size(), 5u);
   EXPECT_EQ(queries[0].data, (Bytes{0x02}));
+  EXPECT_EQ(queries[2].data, (Bytes{0x03}));
   EXPECT_EQ(monitorState.refreshRequests, 0u);
+
+  // The control block goes out as report 2, bytes reordered.
+  const BYTE control[8] = {0x82, 0x00, 0x00, 0x00, 0x07, 0x00, 0xAA, 0xBB};
+  EXPECT_EQ(WriteDriveControl(&drive, control), 0u);
+  EXPECT_EQ(HidReports("gauge"), (std::vector<Bytes>{{0x02, 0xBB, 0xAA, 0x00, 0x07}}));
+  machine_.FailIo("gauge", sim::Endpoint::Hid, ERROR_GEN_FAILURE, 1);
+  EXPECT_EQ(WriteDriveControl(&drive, control), static_cast<DWORD>(ERROR_GEN_FAILURE));
 }
 
 TEST_F(StatusPagesTest, StatusNibbleMapsToTheStatusCode) {
@@ -63,23 +81,7 @@ TEST_F(StatusPagesTest, StatusNibbleMapsToTheStatusCode) {
   }
 }
 
-TEST_F(StatusPagesTest, HidSleepReportGivesTheSleepState) {
-  const DriveRecord drive = HidDrive();
-  BYTE page[5];
-  machine_.SetSleepState("gauge", 6);
-  EXPECT_EQ(ReadSleepState(&drive, page), 2u);
-  EXPECT_EQ(Page(page, 5), (Bytes{0x83, 0x00, 0x00, 0x00, 0x80}));
-  machine_.SetSleepState("gauge", 1);
-  EXPECT_EQ(ReadSleepState(&drive, page), 0u);
-  EXPECT_EQ(page[4], 0x40);
-  machine_.SetSleepState("gauge", 3);
-  EXPECT_EQ(ReadSleepState(&drive, page), 3u);
-  const std::vector<sim::Command> queries = Sent("gauge", Kind::HidInputReport);
-  ASSERT_EQ(queries.size(), 3u);
-  EXPECT_EQ(queries[0].data, (Bytes{0x03}));
-}
-
-TEST_F(StatusPagesTest, DiagnosticPathReadsPagesThroughPassThrough) {
+TEST_F(StatusPagesTest, DiagnosticPathReadsAndWritesPagesThroughPassThrough) {
   const DriveRecord drive = DiagnosticDrive();
   SetStatus(machine_, "enclosure", {0x76, 0x01, 0x02, 0x03});
   machine_.SetSleepState("enclosure", 2);
@@ -89,10 +91,16 @@ TEST_F(StatusPagesTest, DiagnosticPathReadsPagesThroughPassThrough) {
       << "the drive's page is passed on unchanged";
   BYTE sleep[5];
   EXPECT_EQ(ReadSleepState(&drive, sleep), 2u);
+  const BYTE control[8] = {0x82, 0x00, 0x00, 0x00, 0x07, 0x00, 0xAA, 0xBB};
+  EXPECT_EQ(WriteDriveControl(&drive, control), 0u);
   const std::vector<sim::Command> receives = Scsi("enclosure", 0x1C);
   ASSERT_EQ(receives.size(), 2u);
   EXPECT_EQ(receives[0].cdb, (Bytes{0x1C, 0x01, 0x82, 0x00, 0x08, 0x00}));
   EXPECT_EQ(receives[1].cdb, (Bytes{0x1C, 0x01, 0x83, 0x00, 0x05, 0x00}));
+  const std::vector<sim::Command> sends = Scsi("enclosure", 0x1D);
+  ASSERT_EQ(sends.size(), 1u);
+  EXPECT_EQ(sends[0].cdb, (Bytes{0x1D, 0x10, 0x00, 0x00, 0x08, 0x00}));
+  EXPECT_EQ(sends[0].data, Bytes(control, control + 8));
   EXPECT_TRUE(Sent("gauge", Kind::HidInputReport).empty());
 
   machine_.FailIo("enclosure", sim::Endpoint::Enclosure, ERROR_GEN_FAILURE, -1, 0x1C);
@@ -100,23 +108,6 @@ TEST_F(StatusPagesTest, DiagnosticPathReadsPagesThroughPassThrough) {
   EXPECT_EQ(status[0], 0x00);
   EXPECT_EQ(ReadSleepState(&drive, sleep), 3u);
   EXPECT_EQ(monitorState.refreshRequests, 0u) << "the drive opened: no rescan is asked for";
-}
-
-TEST_F(StatusPagesTest, ControlBlockIsWrittenOnEitherPath) {
-  const BYTE control[8] = {0x82, 0x00, 0x00, 0x00, 0x07, 0x00, 0xAA, 0xBB};
-  const DriveRecord hid = HidDrive();
-  EXPECT_EQ(WriteDriveControl(&hid, control), 0u);
-  EXPECT_EQ(HidReports("gauge"), (std::vector<Bytes>{{0x02, 0xBB, 0xAA, 0x00, 0x07}}));
-
-  const DriveRecord diagnostic = DiagnosticDrive();
-  EXPECT_EQ(WriteDriveControl(&diagnostic, control), 0u);
-  const std::vector<sim::Command> sends = Scsi("enclosure", 0x1D);
-  ASSERT_EQ(sends.size(), 1u);
-  EXPECT_EQ(sends[0].cdb, (Bytes{0x1D, 0x10, 0x00, 0x00, 0x08, 0x00}));
-  EXPECT_EQ(sends[0].data, Bytes(control, control + 8));
-
-  machine_.FailIo("gauge", sim::Endpoint::Hid, ERROR_GEN_FAILURE, 1);
-  EXPECT_EQ(WriteDriveControl(&hid, control), static_cast<DWORD>(ERROR_GEN_FAILURE));
 }
 
 // A USB drive whose HID collection never answers: every read and write is
@@ -142,7 +133,7 @@ TEST_F(StatusPagesTest, HungHidCollectionIsGivenUpOnTheStopEvent) {
   CloseHandle(stop);
 }
 
-TEST_F(StatusPagesTest, DriveThatDoesNotOpenAsksForARescan) {
+TEST_F(StatusPagesTest, ADriveThatDoesNotOpenAsksForARescanOnceUnlessNoneCanHelp) {
   machine_.FailOpen("gauge", sim::Endpoint::Hid, ERROR_FILE_NOT_FOUND);
   const DriveRecord drive = HidDrive();
   BYTE status[8];
@@ -156,42 +147,37 @@ TEST_F(StatusPagesTest, DriveThatDoesNotOpenAsksForARescan) {
   EXPECT_EQ(monitorState.gaugePassRequested, 1u);
   EXPECT_EQ(monitorState.sleepPassRequested, 1u);
 
-  // A USB drive whose HID collection is not known yet cannot be opened either.
+  // Once the drive opened again, a new failure asks again.
+  machine_.ClearFaults();
+  ReadDriveStatus(&drive, status);
+  machine_.FailOpen("gauge", sim::Endpoint::Hid, ERROR_FILE_NOT_FOUND);
+  EXPECT_EQ(ReadDriveStatus(&drive, status), 0u);
+  EXPECT_EQ(monitorState.refreshRequests, 2u);
+
+  // Not bound yet (USB without its HID collection, IEEE 1394 without a
+  // control path): the binding may still give it a path.
   DriveRecord unbound{};
   unbound.busKind = 2;
   EXPECT_EQ(ReadDriveStatus(&unbound, status), 0u);
-  EXPECT_EQ(monitorState.refreshRequests, 2u);
-
-  // Once the drive opened again, a new failure asks again.
-  machine_.ClearFaults();
-  ReadDriveStatus(&drive, status);  // opens
-  machine_.FailOpen("gauge", sim::Endpoint::Hid, ERROR_FILE_NOT_FOUND);
-  EXPECT_EQ(ReadDriveStatus(&drive, status), 0u);
   EXPECT_EQ(monitorState.refreshRequests, 3u);
-}
-
-TEST_F(StatusPagesTest, BoundDriveWithoutStatusInterfaceDoesNotAskForRescans) {
-  // An IEEE 1394 drive bound to its button-filter-driver channel has neither
-  // a control interface nor a HID collection; a rescan cannot change that.
-  DriveRecord drive{};
-  drive.busKind = 3;
-  WideCopy(drive.channelPath, 256, FireWire()->devicePath);
-  WideCopy(drive.hidPath, 256, FireWire()->devicePath);
-  BYTE status[8];
-  BYTE sleep[5];
-  const BYTE control[8] = {};
-  EXPECT_EQ(ReadDriveStatus(&drive, status), 0u);
-  EXPECT_EQ(ReadSleepState(&drive, sleep), 3u);
-  EXPECT_EQ(WriteDriveControl(&drive, control), 0xFFFFFFFFu);
-  EXPECT_EQ(monitorState.refreshRequests, 0u);
-  EXPECT_TRUE(machine_.Commands().empty()) << machine_.Transcript();
-
-  // Not bound yet: the binding may still give it a path, so a rescan is asked for.
-  DriveRecord unbound{};
   unbound.busKind = 3;
   EXPECT_EQ(ReadDriveStatus(&unbound, status), 0u);
   EXPECT_EQ(ReadDriveStatus(&unbound, status), 0u);
-  EXPECT_EQ(monitorState.refreshRequests, 1u) << "not again on every pass";
+  EXPECT_EQ(monitorState.refreshRequests, 4u) << "not again on every pass";
+
+  // An IEEE 1394 drive bound to its button-filter-driver channel has neither
+  // a control interface nor a HID collection; a rescan cannot change that.
+  machine_.ClearCommands();
+  DriveRecord bound{};
+  bound.busKind = 3;
+  WideCopy(bound.channelPath, 256, FireWire()->devicePath);
+  WideCopy(bound.hidPath, 256, FireWire()->devicePath);
+  monitorState.refreshRequests = 0;
+  EXPECT_EQ(ReadDriveStatus(&bound, status), 0u);
+  EXPECT_EQ(ReadSleepState(&bound, sleep), 3u);
+  EXPECT_EQ(WriteDriveControl(&bound, control), 0xFFFFFFFFu);
+  EXPECT_EQ(monitorState.refreshRequests, 0u);
+  EXPECT_TRUE(machine_.Commands().empty()) << machine_.Transcript();
 }
 
 }  // namespace

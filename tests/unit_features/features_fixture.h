@@ -200,6 +200,14 @@ class FeatureTest : public MachineTest<sim::Machine> {
     }
     return out;
   }
+  // Data of one button-filter-driver control the drive got, in order.
+  std::vector<Bytes> ControlData(const std::string& drive, DWORD code) {
+    std::vector<Bytes> out;
+    for (const sim::Command& c : Sent(drive, Kind::Control)) {
+      if (c.code == code) out.push_back(c.data);
+    }
+    return out;
+  }
   // SEND DIAGNOSTIC pages (page code and parameter byte) an enclosure got.
   std::vector<Bytes> EnclosurePages(const std::string& drive) {
     std::vector<Bytes> out;

@@ -9,20 +9,17 @@ namespace featuretest {
 namespace {
 
 TEST(GaugePatternTest, IndexFollowsTheSegmentWidth) {
-  EXPECT_EQ(GaugePattern(50, 6), 0x8F00);
-  EXPECT_EQ(GaugePattern(50, 4), 0x8700);
-  EXPECT_EQ(GaugePattern(16, 6), 0x8100);
-  EXPECT_EQ(GaugePattern(17, 6), 0x8300);
-  EXPECT_EQ(GaugePattern(0, 6), 0x8100);
-  EXPECT_EQ(GaugePattern(99, 6), 0xBF00);
-  EXPECT_EQ(GaugePattern(100, 6), 0x0000) << "index 6 holds no pattern";
-  EXPECT_EQ(GaugePattern(100, 4), 0x9F00) << "four segments reach index 4";
-  EXPECT_EQ(GaugePattern(75, 4), 0x8F00);
-  EXPECT_EQ(GaugePattern(74, 4), 0x8700);
-  EXPECT_EQ(GaugePattern(40, 0), 0x0000);
-  // Never beyond the table, whatever the segment count.
-  EXPECT_EQ(GaugePattern(100, 8), 0x0000);
-  EXPECT_EQ(GaugePattern(100, 64), 0x0000);
+  // Index 6 holds no pattern; four segments reach index 4; never beyond the
+  // table, whatever the segment count.
+  const struct {
+    DWORD percent, segments, pattern;
+  } rows[] = {{50, 6, 0x8F00}, {50, 4, 0x8700},  {16, 6, 0x8100},  {17, 6, 0x8300}, {0, 6, 0x8100},
+              {99, 6, 0xBF00}, {100, 6, 0x0000}, {100, 4, 0x9F00}, {75, 4, 0x8F00}, {74, 4, 0x8700},
+              {40, 0, 0x0000}, {100, 8, 0x0000}, {100, 64, 0x0000}};
+  for (const auto& row : rows) {
+    EXPECT_EQ(GaugePattern(row.percent, row.segments), row.pattern)
+        << row.percent << " % on " << row.segments;
+  }
 }
 
 class GaugeTest : public FeatureTest {};
@@ -110,59 +107,48 @@ TEST_F(GaugeTest, PatternIsSentOnlyWhenThePercentageChanges) {
   EXPECT_EQ(gauge->gaugePercentSent, 0u);
 }
 
-TEST_F(GaugeTest, EachTransportCarriesThePatternAndFullDrivesSendZero) {
-  // Each drive is 50 % used.
-  ChannelRecord* lights = Lights();  // driver channel, mode 1
-  ChannelRecord* enclosure = Enclosure();
-  ChannelRecord* gauge = Gauge();
+TEST_F(GaugeTest, EachTransportCarriesThePatternAndOnlyTheDriverSendsZero) {
+  // Every drive is 50 % used. Mode 0 never sends; the percentage is kept
+  // whatever went out.
+  ChannelRecord* lights = Lights();        // driver channel, mode 1, six segments
+  ChannelRecord* enclosure = Enclosure();  // four segments
+  ChannelRecord* plain = Plain();
   DriveRecord lightsDrive = CopyOf(lights);
   DriveRecord enclosureDrive = CopyOf(enclosure);
-  ASSERT_EQ(lightsDrive.gaugeSegments, 6u);
-  ASSERT_EQ(enclosureDrive.gaugeSegments, 4u);
+  DriveRecord plainDrive = CopyOf(plain);
   UpdateCapacityGauge(&lightsDrive, lights, nullptr);
   UpdateCapacityGauge(&enclosureDrive, enclosure, nullptr);
-  const std::vector<sim::Command> controls = Sent("lights", Kind::Control);
-  ASSERT_EQ(controls.size(), 1u);
-  EXPECT_EQ(controls[0].code, CTL_SET_GAUGE);
-  EXPECT_EQ(controls[0].data, (Bytes{0x00, 0x8F, 0x00, 0x00}));
+  UpdateCapacityGauge(&plainDrive, plain, nullptr);
+  EXPECT_EQ(ControlData("lights", CTL_SET_GAUGE), (std::vector<Bytes>{{0x00, 0x8F, 0x00, 0x00}}));
   EXPECT_EQ(EnclosurePages("enclosure"), (std::vector<Bytes>{{0x81, 0x87}}));
+  EXPECT_TRUE(Sent("plain", Kind::HidOutput).empty());
+  EXPECT_EQ(plain->gaugePercentSent, 50u);
+  EXPECT_EQ(Working(plain).gaugePercent, 50u);
 
-  // 100 % used on six segments: pattern 0. The driver channel sends it, the
-  // HID and enclosure transports send nothing; the percentage is kept.
+  // Full on six segments: pattern 0, which the HID and enclosure transports
+  // do not send.
   machine_.ClearCommands();
-  machine_.SetFreeBytes('J', 0);
-  machine_.SetFreeBytes('I', 0);
-  machine_.SetFreeBytes('E', 0);
-  machine_.SetFreeBytes('K', 0);
+  for (char letter : {'J', 'I', 'E', 'K'}) machine_.SetFreeBytes(letter, 0);
+  ChannelRecord* gauge = Gauge();
   DriveRecord gaugeDrive = CopyOf(gauge);
   gaugeDrive.gaugeSegments = 6;
   enclosureDrive.gaugeSegments = 6;
   UpdateCapacityGauge(&lightsDrive, lights, nullptr);
   UpdateCapacityGauge(&enclosureDrive, enclosure, nullptr);
   UpdateCapacityGauge(&gaugeDrive, gauge, nullptr);
-  ASSERT_EQ(Sent("lights", Kind::Control).size(), 1u);
-  EXPECT_EQ(Sent("lights", Kind::Control)[0].data, (Bytes{0x00, 0x00, 0x00, 0x00}));
+  EXPECT_EQ(ControlData("lights", CTL_SET_GAUGE), (std::vector<Bytes>{{0, 0, 0, 0}}));
   EXPECT_TRUE(EnclosurePages("enclosure").empty());
   EXPECT_TRUE(HidValues("gauge").empty());
   EXPECT_EQ(enclosure->gaugePercentSent, 100u);
   EXPECT_EQ(Working(gauge).gaugePercent, 100u);
-}
 
-TEST_F(GaugeTest, PlainChannelsAndSegmentlessDrivesKeepThePercentage) {
-  ChannelRecord* plain = Plain();  // mode 0: never a gauge command
-  DriveRecord plainDrive = CopyOf(plain);
-  UpdateCapacityGauge(&plainDrive, plain, nullptr);
-  EXPECT_EQ(plain->gaugePercentSent, 50u);
-  EXPECT_EQ(Working(plain).gaugePercent, 50u);
-  EXPECT_TRUE(Sent("plain", Kind::HidOutput).empty());
-
-  ChannelRecord* lights = Lights();
-  DriveRecord lightsDrive = CopyOf(lights);
+  // A drive without segments gets pattern 0 too.
+  machine_.ClearCommands();
+  machine_.SetFreeBytes('J', 500 * kMiB);
   lightsDrive.gaugeSegments = 0;
   UpdateCapacityGauge(&lightsDrive, lights, nullptr);
   EXPECT_EQ(lights->gaugePercentSent, 50u);
-  ASSERT_EQ(Sent("lights", Kind::Control).size(), 1u);
-  EXPECT_EQ(Sent("lights", Kind::Control)[0].data, (Bytes{0x00, 0x00, 0x00, 0x00}));
+  EXPECT_EQ(ControlData("lights", CTL_SET_GAUGE), (std::vector<Bytes>{{0, 0, 0, 0}}));
 }
 
 TEST_F(GaugeTest, DriveWithoutVolumesAsksForARescan) {

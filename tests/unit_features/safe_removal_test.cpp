@@ -21,6 +21,9 @@ class SafeRemovalTest : public FeatureTest {
     DriveRecord copy = CopyOf(channel);
     return SafeRemoveDrive(&copy, channel);
   }
+  ChannelRecord* Of(const std::string& drive) {
+    return drive == "gauge" ? Gauge() : drive == "plain" ? Plain() : FireWire();
+  }
   // The removal left the drive and its channel as they were.
   void ExpectNotRemoved(const std::string& drive, const ChannelRecord* channel, LONG linked) {
     EXPECT_TRUE(machine_.Attached(drive));
@@ -29,25 +32,13 @@ class SafeRemovalTest : public FeatureTest {
   }
 };
 
-TEST_F(SafeRemovalTest, RemovesTheDriveAndUnlinksItsChannel) {
-  ChannelRecord* gauge = Gauge();
-  ASSERT_EQ(Remove(gauge), 1);
-  EXPECT_EQ(machine_.DismountCount('E'), 1);
-  EXPECT_EQ(machine_.DismountCount('K'), 1);
-  const auto ejects = machine_.Ejects();
-  ASSERT_EQ(ejects.size(), 1u);
-  EXPECT_FALSE(ejects[0].queryAndRemove) << "the parent may be surprise-removed: eject request";
-  EXPECT_TRUE(NamesFunctionNode(ejects[0])) << ejects[0].instanceId;
-  EXPECT_FALSE(machine_.Attached("gauge"));
-  EXPECT_EQ(gauge->driveGoneSent, 1u);
-  EXPECT_EQ(gauge->linkedDrive, -1);
-  EXPECT_EQ(monitorState.skipTicks, kDriveGoneSkipTicks);
-  EXPECT_TRUE(machine_.Attached("plain"));
-}
-
-TEST_F(SafeRemovalTest, WithoutABoundDriveNothingIsTouched) {
-  // An empty drive list: nothing says the volumes are offline.
+TEST_F(SafeRemovalTest, WithoutABoundDriveOrAKnownNodeNothingIsTouched) {
   ChannelRecord* plain = Plain();
+  DriveRecord unknown = CopyOf(plain);
+  WideCopy(unknown.parentDeviceId, 256, WSTR("USB\\VID_0000&PID_0000\\NOWHERE"));
+  EXPECT_EQ(EjectDriveDevice(&unknown, plain), 0);
+
+  // An empty drive list: nothing says the volumes are offline.
   const LONG linked = plain->linkedDrive;
   DriveRecord copy = CopyOf(plain);
   Block().driveCount = 0;
@@ -124,7 +115,7 @@ TEST_F(SafeRemovalTest, OnlyAMissingMediumCountsAsNothingToDismount) {
   for (const auto& c : noMedium) {
     machine_.SetMediumCheckError(c.letter, c.error);
     monitorState.driveListStale = 0;
-    EXPECT_EQ(Remove(Channel(c.drive == std::string("plain") ? "pid_2a31" : "external_hdd#")), 1);
+    EXPECT_EQ(Remove(Of(c.drive)), 1);
     EXPECT_FALSE(machine_.Attached(c.drive));
     EXPECT_EQ(machine_.DismountCount(c.letter), 0);
     EXPECT_EQ(monitorState.driveListStale, 1u);
@@ -165,48 +156,49 @@ TEST_F(SafeRemovalTest, HeldVolumeStopsTheRemovalBeforeAnyEject) {
   EXPECT_EQ(machine_.OpenCount("gauge", sim::Endpoint::Hid), 0u);
 }
 
-TEST_F(SafeRemovalTest, VetoIsRetriedFourTimes) {
-  ChannelRecord* gauge = Gauge();
-  const LONG linked = gauge->linkedDrive;
-  machine_.SetEjectVeto("gauge", PNP_VetoOutstandingOpen, "another program");
-  EXPECT_EQ(Remove(gauge), 0);
-  const auto ejects = machine_.Ejects();
-  // Each attempt: eject request, then query-and-remove narrow and wide.
-  ASSERT_EQ(ejects.size(), 12u);
-  for (std::size_t i = 0; i < ejects.size(); ++i) {
-    EXPECT_TRUE(ejects[i].vetoed);
-    EXPECT_EQ(ejects[i].queryAndRemove, i % 3 != 0) << i;
+TEST_F(SafeRemovalTest, VetoedEjectIsRetriedFourTimesInThreeForms) {
+  // Each attempt: eject request, then query-and-remove narrow and wide; a
+  // node that cannot be surprise-removed is only queried and removed.
+  const struct {
+    const char* drive;
+    int vetoes;  // -1: every request
+    bool surpriseRemovable;
+    std::size_t requests;
+  } rows[] = {
+      {"plain", -1, true, 12},
+      {"plain", 1, true, 2},
+      {"gauge", 3, true, 4},      // the fourth attempt's eject request succeeds
+      {"firewire", 2, false, 3},  // IEEE 1394 unit: capabilities 0x04
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(std::string(row.drive) + " " + std::to_string(row.vetoes));
+    ChannelRecord* channel = Of(row.drive);
+    const LONG linked = channel->linkedDrive;
+    const std::size_t before = machine_.Ejects().size();
+    monitorState.skipTicks = 0;
+    machine_.SetEjectVeto(row.drive, PNP_VetoOutstandingOpen, "another program", row.vetoes);
+    EXPECT_EQ(Remove(channel), row.vetoes < 0 ? 0 : 1);
+    const auto ejects = machine_.Ejects();
+    ASSERT_EQ(ejects.size() - before, row.requests);
+    for (std::size_t i = 0; i < row.requests; ++i) {
+      const auto& request = ejects[before + i];
+      EXPECT_EQ(request.vetoed, row.vetoes < 0 || i < static_cast<std::size_t>(row.vetoes)) << i;
+      EXPECT_EQ(request.queryAndRemove, !row.surpriseRemovable || i % 3 != 0) << i;
+      EXPECT_EQ(NamesFunctionNode(request), row.surpriseRemovable) << request.instanceId;
+    }
+    if (row.vetoes < 0) {
+      ExpectNotRemoved(row.drive, channel, linked);
+      EXPECT_NE(channel->deviceHandle, nullptr);
+    } else {
+      EXPECT_FALSE(machine_.Attached(row.drive));
+      EXPECT_EQ(channel->linkedDrive, -1);
+      EXPECT_EQ(channel->driveGoneSent, 1u);
+      EXPECT_EQ(monitorState.skipTicks, kDriveGoneSkipTicks);
+    }
   }
-  ExpectNotRemoved("gauge", gauge, linked);
-  EXPECT_NE(gauge->deviceHandle, nullptr);
-}
-
-TEST_F(SafeRemovalTest, VetoThatEndsLetsALaterAttemptSucceed) {
-  ChannelRecord* gauge = Gauge();
-  machine_.SetEjectVeto("gauge", PNP_VetoOutstandingOpen, "another program", 3);
-  EXPECT_EQ(Remove(gauge), 1);
-  EXPECT_EQ(machine_.Ejects().size(), 4u);
-  EXPECT_FALSE(machine_.Attached("gauge"));
-
-  // One veto: the query-and-remove after the refused request succeeds.
-  ChannelRecord* plain = Plain();
-  machine_.SetEjectVeto("plain", PNP_VetoWindowsApp, "explorer", 1);
-  EXPECT_EQ(Remove(plain), 1);
-  const auto ejects = machine_.Ejects();
-  ASSERT_EQ(ejects.size(), 6u);
-  EXPECT_TRUE(ejects[5].queryAndRemove);
-  EXPECT_FALSE(ejects[5].vetoed);
-}
-
-TEST_F(SafeRemovalTest, NodeWithoutSurpriseRemovalIsOnlyQueriedAndRemoved) {
-  ChannelRecord* firewire = FireWire();  // IEEE 1394 unit: capabilities 0x04
-  machine_.SetEjectVeto("firewire", PNP_VetoDriver, "sbp2port", 2);
-  EXPECT_EQ(Remove(firewire), 1);
-  const auto ejects = machine_.Ejects();
-  ASSERT_EQ(ejects.size(), 3u);
-  for (const auto& request : ejects) EXPECT_TRUE(request.queryAndRemove);
-  EXPECT_FALSE(machine_.Attached("firewire"));
-  EXPECT_EQ(firewire->linkedDrive, -1);
+  EXPECT_EQ(machine_.DismountCount('E'), 1);
+  EXPECT_EQ(machine_.DismountCount('K'), 1);
+  EXPECT_TRUE(machine_.Attached("enclosure"));
 }
 
 TEST_F(SafeRemovalTest, LibraryAndFunctionsAreFoundAtRunTime) {
@@ -235,27 +227,12 @@ TEST_F(SafeRemovalTest, LibraryAndFunctionsAreFoundAtRunTime) {
   EXPECT_TRUE(machine_.Attached("plain"));
 }
 
-TEST_F(SafeRemovalTest, UnknownNodeIsNotEjected) {
-  ChannelRecord* gauge = Gauge();
-  DriveRecord copy = CopyOf(gauge);
-  WideCopy(copy.parentDeviceId, 256, WSTR("USB\\VID_0000&PID_0000\\NOWHERE"));
-  EXPECT_EQ(EjectDriveDevice(&copy, gauge), 0);
-  EXPECT_EQ(SafeRemoveDrive(&copy, gauge), 0);
-  EXPECT_TRUE(machine_.Ejects().empty());
-  EXPECT_TRUE(machine_.Attached("gauge"));
-}
-
 // Windows 2000: the two listed models are told of the eject and their USB
 // parent is ejected instead of the storage function.
-class Windows2000RemovalTest : public SafeRemovalTest {
- protected:
-  void SetUp() override {
-    SafeRemovalTest::SetUp();
-    monitorState.osKind = kOsWindows2000;
-  }
-};
+using Windows2000RemovalTest = SafeRemovalTest;
 
 TEST_F(Windows2000RemovalTest, ListedModelIsEjectedThroughItsParent) {
+  monitorState.osKind = kOsWindows2000;
   ChannelRecord* plain = Plain();  // model 2A31
   ASSERT_EQ(Remove(plain), 1);
   EXPECT_EQ(HidValues("plain").at(0), (Bytes{0x20, 0x00})) << "eject notice first";
@@ -274,6 +251,7 @@ TEST_F(Windows2000RemovalTest, ListedModelIsEjectedThroughItsParent) {
 }
 
 TEST_F(Windows2000RemovalTest, FailedParentEjectReopensTheChannel) {
+  monitorState.osKind = kOsWindows2000;
   ChannelRecord* plain = Plain();
   const LONG linked = plain->linkedDrive;
   machine_.SetEjectVeto("plain", PNP_VetoOutstandingOpen, "another program");
@@ -294,7 +272,7 @@ TEST_F(Windows2000RemovalTest, FailedParentEjectReopensTheChannel) {
 
 // The listed model served by the maker's own driver service, with a parent
 // that cannot be surprise-removed.
-class OwnDriverRemovalTest : public Windows2000RemovalTest {
+class OwnDriverRemovalTest : public SafeRemovalTest {
   void Customize(std::vector<sim::DriveSpec>* drives) override {
     (*drives)[1].parentService = "VEVUV_UR";
     (*drives)[1].parentCapabilities = 0x04;
@@ -302,6 +280,7 @@ class OwnDriverRemovalTest : public Windows2000RemovalTest {
 };
 
 TEST_F(OwnDriverRemovalTest, StorageFunctionIsEjectedWithoutNotice) {
+  monitorState.osKind = kOsWindows2000;
   ChannelRecord* plain = Plain();
   ASSERT_EQ(Remove(plain), 1);
   const auto ejects = machine_.Ejects();
