@@ -144,57 +144,6 @@ TEST_F(ChannelTest, ScanClassifiesEachInterfaceAndClearsEveryOtherRecord) {
   }
 }
 
-TEST_F(ChannelTest, BindingLinksTheChannelsOfEachKindToTheirDrives) {
-  sim::DriveSpec usb = HidDrive("usb", "7B44", "5553424844");
-  sim::VolumeSpec volume;
-  volume.letter = 'E';
-  usb.volumes = {volume};
-  const sim::DriveSpec enclosure = EnclosureDrive("enclosure", "0030E00000045D6F", 3);
-  const sim::DriveSpec fireWire = DriverDrive("firewire", "0030E0000001A2B3", 1,
-                                              "1394\\QX&EXTERNAL_HDD&FILTER\\0030E0000001A2B3");
-  machine_.AddDrive(usb);
-  machine_.AddDrive(enclosure);
-  machine_.AddDrive(fireWire);
-  Install();
-  Discover();
-  ASSERT_EQ(Block().driveCount, 3);
-  ASSERT_EQ(Block().channelCount, 3);
-
-  ChannelRecord* hid = ChannelOf(usb.hidInstanceId);
-  ASSERT_NE(hid, nullptr);
-  WideCopy(hid->identityText, 128, WSTR("5553424844"));  // the HID serial, as the worker reads it
-  monitorState.publishNeeded = 0;
-  DriveRecord copy{};
-  ASSERT_EQ(BindChannelToDrive(hid, &copy, 0), 0);
-  EXPECT_EQ(monitorState.publishNeeded, 1u);
-  const DriveRecord& usbDrive = Drive(0);
-  EXPECT_EQ(hid->linkedDrive, 0);
-  EXPECT_EQ(usbDrive.channelIndex, hid->ownIndex);
-  EXPECT_EQ(usbDrive.channelMode, 1u);
-  EXPECT_EQ(N(usbDrive.channelPath), N(hid->devicePath));
-  EXPECT_EQ(N(usbDrive.hidPath), N(hid->devicePath));
-  EXPECT_EQ(usbDrive.controlPath[0], 0);
-  EXPECT_EQ(usbDrive.fromChannel, 0u);
-  EXPECT_EQ(N(hid->diskPath), usb.diskPath);
-  EXPECT_EQ(std::string(reinterpret_cast<const char*>(hid->volumeLetters), 4),
-            std::string("E\0\0\0", 4));
-  EXPECT_EQ(std::memcmp(&copy, &usbDrive, sizeof(copy)), 0);
-
-  ChannelRecord* ses = ChannelOf(enclosure.controlInstanceId);
-  ASSERT_NE(ses, nullptr);
-  ASSERT_EQ(BindChannelToDrive(ses, nullptr, 0), 1);  // instance key equals the tail
-  EXPECT_EQ(Drive(1).channelMode, 2u);
-  EXPECT_EQ(N(Drive(1).controlPath), PathOf(enclosure.controlInstanceId, kClassCGuid));
-  EXPECT_EQ(N(ses->diskPath), enclosure.diskPath);
-
-  ChannelRecord* driver = ChannelOf(fireWire.controlInstanceId);
-  ASSERT_NE(driver, nullptr);
-  ASSERT_EQ(BindChannelToDrive(driver, nullptr, 0), 2);  // the parent's ID carries the tail
-  EXPECT_EQ(Drive(2).channelIndex, driver->ownIndex);
-  EXPECT_EQ(Drive(2).controlPath[0], 0);  // class A is no control interface
-  EXPECT_EQ(Block().driveCount, 3);
-}
-
 TEST_F(ChannelTest, AChannelWithoutDiskMakesOneRecordHoweverOftenItBinds) {
   machine_.AddDrive(HidDrive("usb", "7B44", "2D41"));
   machine_.FailOpen("usb", sim::Endpoint::Disk, ERROR_ACCESS_DENIED);

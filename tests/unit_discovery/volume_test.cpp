@@ -24,12 +24,16 @@ sim::VolumeSpec Volume(char letter, UINT type, std::uint32_t partition = 1) {
 
 class VolumeTest : public DiscoveryTest {
  protected:
-  // A system disk (number 0) with C:, a CD-ROM D: and a floppy A: that claim
+  // A system disk (number 0) with C:, a volume S: that spans disks (with
+  // the number that stands for none), a CD-ROM D: and a floppy A: that claim
   // the drive's disk number, and the maker's drive with the given volumes.
   void Build(const std::vector<sim::VolumeSpec>& driveVolumes) {
     sim::VolumeSpec system = Volume('C', DRIVE_FIXED);
     system.diskNumber = 0;
     machine_.AddVolume(system);
+    sim::VolumeSpec spanned = Volume('S', DRIVE_FIXED);
+    spanned.diskNumber = 0xFFFFFFFF;
+    machine_.AddVolume(spanned);
     sim::DriveSpec spec = UsbDrive("drive", "7B44", "564F4C");
     spec.volumes = driveVolumes;
     machine_.AddDrive(spec);
@@ -44,24 +48,16 @@ class VolumeTest : public DiscoveryTest {
   }
 };
 
-TEST_F(VolumeTest, LettersOfTheDrivesVolumesInLetterOrder) {
+TEST_F(VolumeTest, LettersOfTheDrivesVolumesInLetterOrderAndNoneWithoutADiskNumber) {
   Build({Volume('G', DRIVE_REMOVABLE, 2), Volume('F', DRIVE_FIXED, 1)});
   EnumerateDrives(nullptr);
   ASSERT_EQ(Block().driveCount, 1);
   AssignVolumeLetters();
-  const DriveRecord& drive = Drive(0);
-  EXPECT_EQ(drive.diskNumber, machine_.DiskNumber("drive"));
-  EXPECT_EQ(N(drive.volumeLetters), "FG");  // not A: or the CD-ROM, not C: of disk 0
-  EXPECT_EQ(drive.volumeCount, 2u);
-  EXPECT_EQ(drive.volumeDriveType, DWORD{DRIVE_REMOVABLE});  // that of the last letter
-}
+  EXPECT_EQ(Drive(0).diskNumber, machine_.DiskNumber("drive"));
+  EXPECT_EQ(N(Drive(0).volumeLetters), "FG");  // not A:, the CD-ROM, C: of disk 0 or S:
+  EXPECT_EQ(Drive(0).volumeCount, 2u);
+  EXPECT_EQ(Drive(0).volumeDriveType, DWORD{DRIVE_REMOVABLE});  // that of the last letter
 
-TEST_F(VolumeTest, ADriveWithoutDiskNumberGetsNoLetters) {
-  // A volume that spans disks reports the number that stands for none.
-  sim::VolumeSpec spanned = Volume('S', DRIVE_FIXED);
-  spanned.diskNumber = 0xFFFFFFFF;
-  machine_.AddVolume(spanned);
-  Build({Volume('E', DRIVE_FIXED)});
   machine_.FailIo("drive", sim::Endpoint::Disk, ERROR_NOT_READY, -1,
                   IOCTL_STORAGE_GET_DEVICE_NUMBER);
   EnumerateDrives(nullptr);
