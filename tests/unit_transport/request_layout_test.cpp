@@ -74,36 +74,29 @@ class RequestLayoutTest : public ::testing::Test {
     emu::SetDeviceProvider(nullptr);
   }
 
-  // The common fields of every request, and the command's own.
+  // The common fields of every request, and the command's own. The device
+  // reads and writes a copy of the data right behind the request, in the
+  // request's own block, never the caller's buffer; everything else,
+  // padding included, is zero.
   void ExpectRequest(const Captured& captured, BYTE cdbLength, BYTE dataIn, DWORD dataLength,
-                     const void* data, std::vector<BYTE> cdb) {
+                     std::vector<BYTE> cdb) {
     EXPECT_EQ(captured.code, 0x4D014u);
     EXPECT_EQ(captured.inputLength, 80u);
     EXPECT_EQ(captured.outputLength, 80u);
     EXPECT_TRUE(captured.sameBuffer);
-    const SCSI_PASS_THROUGH_DIRECT& spt = captured.request.spt;
-    EXPECT_EQ(spt.Length, 56);
-    EXPECT_EQ(spt.ScsiStatus, 0);
-    EXPECT_EQ(spt.PathId, 0);
-    EXPECT_EQ(spt.TargetId, 0);
-    EXPECT_EQ(spt.Lun, 0);
-    EXPECT_EQ(spt.CdbLength, cdbLength);
-    EXPECT_EQ(spt.SenseInfoLength, 18);
-    EXPECT_EQ(spt.DataIn, dataIn);
-    EXPECT_EQ(spt.DataTransferLength, dataLength);
-    EXPECT_EQ(spt.TimeOutValue, 20u);
-    if (data != nullptr) {
-      // The device reads and writes a copy of the data right behind the
-      // request, in the request's own block, never the caller's buffer.
-      EXPECT_EQ(spt.DataBuffer, static_cast<const BYTE*>(captured.input) + 80);
-      EXPECT_NE(spt.DataBuffer, data);
-    }
-    EXPECT_EQ(spt.SenseInfoOffset, 60u);
-    cdb.resize(16, 0);
-    EXPECT_EQ(std::vector<BYTE>(spt.Cdb, spt.Cdb + 16), cdb);
-    EXPECT_EQ(captured.request.totalLength, 80u);
-    const BYTE zeroSense[20] = {};
-    EXPECT_EQ(std::memcmp(captured.request.sense, zeroSense, sizeof(zeroSense)), 0);
+    PassThroughRequest expected{};
+    SCSI_PASS_THROUGH_DIRECT& spt = expected.spt;
+    spt.Length = 56;
+    spt.CdbLength = cdbLength;
+    spt.SenseInfoLength = 18;
+    spt.DataIn = dataIn;
+    spt.DataTransferLength = dataLength;
+    spt.TimeOutValue = 20;
+    spt.DataBuffer = const_cast<BYTE*>(static_cast<const BYTE*>(captured.input) + 80);
+    spt.SenseInfoOffset = 60;
+    std::copy(cdb.begin(), cdb.end(), spt.Cdb);
+    expected.totalLength = 80;
+    EXPECT_EQ(std::memcmp(&captured.request, &expected, sizeof(expected)), 0) << int{cdb[0]};
   }
 
   RecordingProvider provider_;
@@ -130,11 +123,11 @@ TEST_F(RequestLayoutTest, EveryOperationFillsTheBlockAsTheDriverExpects) {
 
   const std::vector<Captured>& log = provider_.log;
   ASSERT_EQ(log.size(), 5u);
-  ExpectRequest(log[0], 10, SCSI_IOCTL_DATA_IN, 8, nullptr, {0x25, 0, 0, 0, 0, 0, 0, 0, 0, 0});
-  ExpectRequest(log[1], 6, SCSI_IOCTL_DATA_IN, 74, inquiry, {0x12, 0, 0, 0, 74, 0});
-  ExpectRequest(log[2], 6, SCSI_IOCTL_DATA_IN, 36, page, {0x12, 0x01, 0xC1, 0, 36, 0});
-  ExpectRequest(log[3], 6, SCSI_IOCTL_DATA_IN, 8, status, {0x1C, 0x01, 0x83, 0, 8, 0});
-  ExpectRequest(log[4], 6, SCSI_IOCTL_DATA_OUT, 6, gauge, {0x1D, 0x10, 0, 0, 6, 0});
+  ExpectRequest(log[0], 10, SCSI_IOCTL_DATA_IN, 8, {0x25, 0, 0, 0, 0, 0, 0, 0, 0, 0});
+  ExpectRequest(log[1], 6, SCSI_IOCTL_DATA_IN, 74, {0x12, 0, 0, 0, 74, 0});
+  ExpectRequest(log[2], 6, SCSI_IOCTL_DATA_IN, 36, {0x12, 0x01, 0xC1, 0, 36, 0});
+  ExpectRequest(log[3], 6, SCSI_IOCTL_DATA_IN, 8, {0x1C, 0x01, 0x83, 0, 8, 0});
+  ExpectRequest(log[4], 6, SCSI_IOCTL_DATA_OUT, 6, {0x1D, 0x10, 0, 0, 6, 0});
 }
 
 }  // namespace
