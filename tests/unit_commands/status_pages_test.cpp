@@ -2,8 +2,10 @@
 // control interface (diagnostic pages) and its HID collection (reports).
 #include "transport/status_pages.h"
 
+#include <algorithm>
 #include <chrono>
 #include <future>
+#include <set>
 
 #include "commands_fixture.h"
 
@@ -108,6 +110,38 @@ TEST_F(StatusPagesTest, DiagnosticPathReadsAndWritesPagesThroughPassThrough) {
   EXPECT_EQ(status[0], 0x00);
   EXPECT_EQ(ReadSleepState(&drive, sleep), 3u);
   EXPECT_EQ(monitorState.refreshRequests, 0u) << "the drive opened: no rescan is asked for";
+}
+
+// What enumeration, a status read and a control write hand to the port
+// driver: the block it expects, the data right behind the request in the
+// request's own block (never the caller's buffer), sense space zeroed.
+TEST_F(StatusPagesTest, EveryPassThroughRequestIsTheBlockThePortDriverExpects) {
+  machine_.requests.clear();
+  EnumerateDrives(nullptr);
+  const DriveRecord drive = DiagnosticDrive();
+  BYTE status[8];
+  ReadDriveStatus(&drive, status);
+  const BYTE control[8] = {0x82};
+  WriteDriveControl(&drive, control);
+  std::set<BYTE> operations;
+  for (const TestMachine::Request& r : machine_.requests) {
+    const SCSI_PASS_THROUGH_DIRECT& spt = r.block.spt;
+    SCOPED_TRACE(int{spt.Cdb[0]});
+    operations.insert(spt.Cdb[0]);
+    EXPECT_EQ(r.input, r.output);
+    EXPECT_EQ(r.inputLength, 80u);
+    EXPECT_EQ(r.outputLength, 80u);
+    EXPECT_EQ(spt.Length, 56);
+    EXPECT_EQ(spt.ScsiStatus | spt.PathId | spt.TargetId | spt.Lun, 0);
+    EXPECT_EQ(spt.CdbLength, spt.Cdb[0] == 0x25 ? 10 : 6);
+    EXPECT_EQ(spt.SenseInfoLength, 18);
+    EXPECT_EQ(spt.TimeOutValue, 20u);
+    EXPECT_EQ(spt.DataBuffer, static_cast<const BYTE*>(r.input) + 80);
+    EXPECT_EQ(spt.SenseInfoOffset, 60u);
+    EXPECT_EQ(r.block.totalLength, 80u);
+    EXPECT_EQ(std::count(r.block.sense, r.block.sense + 20, 0), 20);
+  }
+  EXPECT_EQ(operations, (std::set<BYTE>{0x12, 0x25, 0x1C, 0x1D}));
 }
 
 // A USB drive whose HID collection never answers: every read and write is

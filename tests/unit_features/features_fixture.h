@@ -110,7 +110,7 @@ class MachineTest : public ::testing::Test {
     AssignVolumeLetters();
     RebuildChannelTable();
     ASSERT_EQ(Block().channelCount, channels);
-    for (int i = 0; i < channels; ++i) OpenShared(&Block().channels[i]);
+    for (int i = 0; i < channels; ++i) testsupport::OpenSharedChannelHandle(&Block().channels[i]);
     machine_.ClearCommands();
   }
 
@@ -125,7 +125,6 @@ class MachineTest : public ::testing::Test {
     monitorState = MonitorState{};
   }
 
-  static void OpenShared(ChannelRecord* channel) { testsupport::OpenSharedChannelHandle(channel); }
   StateBlock& Block() { return *block_; }
   ChannelRecord* Channel(const std::string& part) {
     return testsupport::FindChannel(Block(), part);
@@ -174,10 +173,6 @@ class FeatureTest : public MachineTest<sim::Machine> {
       ASSERT_GE(BindChannelToDrive(&channel, nullptr, 0), 0) << Narrow(channel.devicePath);
       ASSERT_GE(channel.linkedDrive, 0);
     }
-    monitorState.refreshRequests = 0;
-    monitorState.burstRequested = 0;
-    monitorState.gaugePassRequested = 0;
-    monitorState.sleepPassRequested = 0;
     machine_.ClearCommands();
   }
 

@@ -1,8 +1,8 @@
 // The SCSI pass-through transport against a simulated drive: rejected
 // commands, short replies, and the abort of a pending transfer, including a
 // device that is slow to cancel. The replies themselves are pinned by the
-// enumeration's and the status pages' tests, the request blocks by the
-// request layout test.
+// enumeration's and the status pages' tests, which also check the request
+// blocks.
 #include "transport/pass_through.h"
 
 #include <gtest/gtest.h>
@@ -21,8 +21,6 @@ namespace {
 
 constexpr char kDrive[] = "disk";
 
-using Bytes = std::vector<std::uint8_t>;
-
 class PassThroughTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -30,8 +28,6 @@ class PassThroughTest : public ::testing::Test {
     sim::DriveSpec spec;
     spec.name = kDrive;
     spec.channel = sim::ChannelKind::None;
-    spec.lastLba = 4096;
-    spec.blockLength = 512;
     machine_.AddDrive(spec);
     machine_.Install();
     InterfaceList list(GUID_DEVINTERFACE_DISK);
@@ -44,7 +40,6 @@ class PassThroughTest : public ::testing::Test {
     ASSERT_TRUE(disk_.Valid());
     abort_.Reset(CreateEventW(nullptr, TRUE, FALSE, nullptr));
     ownEvent_.Reset(CreateEventW(nullptr, FALSE, FALSE, nullptr));
-    machine_.ClearCommands();
   }
 
   void TearDown() override {
