@@ -1,15 +1,266 @@
-// Safe removal: volumes offline, the device node ejected (retried while
-// vetoed), the drive-gone command and the channel unlinked; and the paths on
+// The drive features against simulated drives: the capacity gauge, the
+// drive-gone command, and safe removal (volumes offline, the device node
+// ejected and retried while vetoed, the channel unlinked) with the paths on
 // which nothing is ejected.
-#include "volume/safe_removal.h"
-
 #include "features_fixture.h"
+#include "monitor/rescan.h"
+#include "service/interface_classes.h"
 #include "transport/drive_command.h"
 #include "transport/drive_features.h"
 #include "volume/eject.h"
+#include "volume/safe_removal.h"
 
 namespace featuretest {
 namespace {
+
+TEST(GaugePatternTest, IndexFollowsTheSegmentWidth) {
+  // Index 6 holds no pattern; four segments reach index 4; never beyond the
+  // table, whatever the segment count.
+  const struct {
+    DWORD percent, segments, pattern;
+  } rows[] = {{50, 6, 0x8F00}, {50, 4, 0x8700},  {16, 6, 0x8100},  {17, 6, 0x8300}, {0, 6, 0x8100},
+              {99, 6, 0xBF00}, {100, 6, 0x0000}, {100, 4, 0x9F00}, {75, 4, 0x8F00}, {74, 4, 0x8700},
+              {40, 0, 0x0000}, {100, 8, 0x0000}, {100, 64, 0x0000}};
+  for (const auto& row : rows) {
+    EXPECT_EQ(GaugePattern(row.percent, row.segments), row.pattern)
+        << row.percent << " % on " << row.segments;
+  }
+}
+
+class GaugeTest : public FeatureTest {};
+
+TEST_F(GaugeTest, UsedSpaceIsSummedInMebibytesOverReadableVolumes) {
+  DriveRecord drive = CopyOf(Gauge());
+  ASSERT_EQ(drive.volumeCount, 2u);
+  EXPECT_EQ(UsedSpacePercent(&drive), 50u);  // 1000 of 2000 MiB free
+
+  // 16 % and 17 % used, the two sides of the first six-segment step.
+  machine_.SetFreeBytes('E', 840 * kMiB);
+  machine_.SetFreeBytes('K', 840 * kMiB);
+  EXPECT_EQ(UsedSpacePercent(&drive), 16u);
+  machine_.SetFreeBytes('K', 820 * kMiB);
+  EXPECT_EQ(UsedSpacePercent(&drive), 17u);
+  machine_.SetFreeBytes('E', 0);
+  machine_.SetFreeBytes('K', 0);
+  EXPECT_EQ(UsedSpacePercent(&drive), 100u);
+
+  // A letter whose space cannot be read is left out of the sums.
+  machine_.SetFreeBytes('E', 250 * kMiB);
+  drive.volumeLetters[1] = WSTR('Q');
+  EXPECT_EQ(UsedSpacePercent(&drive), 75u);
+  drive.volumeLetters[0] = WSTR('R');
+  EXPECT_EQ(UsedSpacePercent(&drive), 0u) << "no readable volume shows 0 % used";
+}
+
+class LargeVolumeGaugeTest : public FeatureTest {
+  void Customize(std::vector<sim::DriveSpec>* drives) override {
+    // 30 TiB with 25 TiB free, and a volume reporting more free than its size.
+    (*drives)[0].volumes = {Volume('E', 30ull << 20, 25ull << 20), Volume('K', 1000, 3000),
+                            Volume('L', 1000, 250)};
+  }
+};
+
+TEST_F(LargeVolumeGaugeTest, LargeVolumesCountAndImpossibleReadingsDoNot) {
+  DriveRecord drive = CopyOf(Gauge());
+  ASSERT_EQ(drive.volumeCount, 3u);
+  drive.volumeLetters[2] = 0;
+  drive.volumeCount = 1;
+  EXPECT_EQ(UsedSpacePercent(&drive), 17u) << "30 TiB, 5 TiB used";
+  drive = CopyOf(Gauge());
+  drive.volumeLetters[0] = WSTR('L');
+  drive.volumeLetters[2] = 0;
+  drive.volumeCount = 2;
+  // K says 3000 MiB free of 1000: left out, so only L counts (75 % used),
+  // and the gauge can never be driven past 100 %.
+  EXPECT_EQ(UsedSpacePercent(&drive), 75u);
+}
+
+TEST_F(GaugeTest, PatternIsSentOnlyWhenThePercentageChanges) {
+  ChannelRecord* gauge = Gauge();  // HID, mode 1, four segments
+  DriveRecord drive = CopyOf(gauge);
+  ASSERT_EQ(drive.gaugeSegments, 4u);
+  UpdateCapacityGauge(&drive, gauge, nullptr);
+  EXPECT_EQ(gauge->gaugePercentSent, 50u);
+  EXPECT_EQ(Working(gauge).gaugePercent, 50u);
+  ASSERT_EQ(HidValues("gauge"), (std::vector<Bytes>{{0x00, 0x87}}));
+
+  // Unchanged on both sides: nothing.
+  UpdateCapacityGauge(&drive, gauge, nullptr);
+  RefreshChannelGauge(gauge->ownIndex, nullptr);
+  EXPECT_EQ(HidValues("gauge").size(), 1u);
+
+  // The drive fills up: the new pattern goes out.
+  machine_.SetFreeBytes('K', 250 * kMiB);
+  RefreshChannelGauge(gauge->ownIndex, nullptr);
+  EXPECT_EQ(Working(gauge).gaugePercent, 75u);
+  EXPECT_EQ(HidValues("gauge").back(), (Bytes{0x00, 0x8F}));
+
+  // Either stored side cleared (force argument, power suspend): sent again.
+  gauge->gaugePercentSent = 0;
+  RefreshChannelGauge(gauge->ownIndex, nullptr);
+  EXPECT_EQ(HidValues("gauge").size(), 3u);
+  Working(gauge).gaugePercent = 0;
+  RefreshChannelGauge(gauge->ownIndex, nullptr);
+  EXPECT_EQ(HidValues("gauge").size(), 4u);
+  EXPECT_EQ(gauge->gaugePercentSent, 75u);
+
+  // An unlinked channel is skipped.
+  gauge->linkedDrive = -1;
+  gauge->gaugePercentSent = 0;
+  RefreshChannelGauge(gauge->ownIndex, nullptr);
+  EXPECT_EQ(HidValues("gauge").size(), 4u);
+  EXPECT_EQ(gauge->gaugePercentSent, 0u);
+}
+
+TEST_F(GaugeTest, EachTransportCarriesThePatternAndOnlyTheDriverSendsZero) {
+  // Every drive is 50 % used. Mode 0 never sends; the percentage is kept
+  // whatever went out.
+  ChannelRecord* lights = Lights();        // driver channel, mode 1, six segments
+  ChannelRecord* enclosure = Enclosure();  // four segments
+  ChannelRecord* plain = Plain();
+  DriveRecord lightsDrive = CopyOf(lights);
+  DriveRecord enclosureDrive = CopyOf(enclosure);
+  DriveRecord plainDrive = CopyOf(plain);
+  UpdateCapacityGauge(&lightsDrive, lights, nullptr);
+  UpdateCapacityGauge(&enclosureDrive, enclosure, nullptr);
+  UpdateCapacityGauge(&plainDrive, plain, nullptr);
+  EXPECT_EQ(ControlData("lights", CTL_SET_GAUGE), (std::vector<Bytes>{{0x00, 0x8F, 0x00, 0x00}}));
+  EXPECT_EQ(EnclosurePages("enclosure"), (std::vector<Bytes>{{0x81, 0x87}}));
+  EXPECT_TRUE(Sent("plain", Kind::HidOutput).empty());
+  EXPECT_EQ(plain->gaugePercentSent, 50u);
+  EXPECT_EQ(Working(plain).gaugePercent, 50u);
+
+  // Full on six segments: pattern 0, which the HID and enclosure transports
+  // do not send.
+  machine_.ClearCommands();
+  for (char letter : {'J', 'I', 'E', 'K'}) machine_.SetFreeBytes(letter, 0);
+  ChannelRecord* gauge = Gauge();
+  DriveRecord gaugeDrive = CopyOf(gauge);
+  gaugeDrive.gaugeSegments = 6;
+  enclosureDrive.gaugeSegments = 6;
+  UpdateCapacityGauge(&lightsDrive, lights, nullptr);
+  UpdateCapacityGauge(&enclosureDrive, enclosure, nullptr);
+  UpdateCapacityGauge(&gaugeDrive, gauge, nullptr);
+  EXPECT_EQ(ControlData("lights", CTL_SET_GAUGE), (std::vector<Bytes>{{0, 0, 0, 0}}));
+  EXPECT_TRUE(EnclosurePages("enclosure").empty());
+  EXPECT_TRUE(HidValues("gauge").empty());
+  EXPECT_EQ(enclosure->gaugePercentSent, 100u);
+  EXPECT_EQ(Working(gauge).gaugePercent, 100u);
+
+  // A drive without segments gets pattern 0 too.
+  machine_.ClearCommands();
+  machine_.SetFreeBytes('J', 500 * kMiB);
+  lightsDrive.gaugeSegments = 0;
+  UpdateCapacityGauge(&lightsDrive, lights, nullptr);
+  EXPECT_EQ(lights->gaugePercentSent, 50u);
+  EXPECT_EQ(ControlData("lights", CTL_SET_GAUGE), (std::vector<Bytes>{{0, 0, 0, 0}}));
+}
+
+TEST_F(GaugeTest, DriveWithoutVolumesAsksForARescan) {
+  ChannelRecord* lights = Lights();
+  DriveRecord drive = CopyOf(lights);
+  drive.volumeCount = 0;
+  drive.volumeLetters[0] = 0;
+  drive.extendedIdentity = 1;
+  drive.statusCode = 2;  // a drive known to be busy: no rescan
+  UpdateCapacityGauge(&drive, lights, nullptr);
+  EXPECT_EQ(monitorState.refreshRequests, 0u);
+  EXPECT_TRUE(Sent("lights", Kind::Control).empty()) << "0 % used equals the stored 0";
+
+  drive.statusCode = 0;
+  UpdateCapacityGauge(&drive, lights, nullptr);
+  EXPECT_EQ(monitorState.refreshRequests, 1u);
+  drive.extendedIdentity = 0;
+  drive.statusCode = 5;
+  UpdateCapacityGauge(&drive, lights, nullptr);
+  EXPECT_EQ(monitorState.refreshRequests, 1u) << "not again while the drive stays so";
+  // Once it had volumes, losing them again asks again.
+  drive.volumeCount = 1;
+  drive.volumeLetters[0] = WSTR('J');
+  UpdateCapacityGauge(&drive, lights, nullptr);
+  drive.volumeCount = 0;
+  drive.volumeLetters[0] = 0;
+  UpdateCapacityGauge(&drive, lights, nullptr);
+  EXPECT_EQ(monitorState.refreshRequests, 2u);
+  EXPECT_EQ(monitorState.burstRequested, 1u);
+  EXPECT_EQ(monitorState.gaugePassRequested, 1u);
+  EXPECT_EQ(monitorState.sleepPassRequested, 1u);
+}
+
+class DriveGoneTest : public FeatureTest {};
+
+TEST_F(DriveGoneTest, EachChannelGetsItsOwnFormOnce) {
+  EXPECT_EQ(SendDriveGone(Plain()), 1u);  // HID, mode 0: state 4
+  EXPECT_EQ(HidValues("plain"), (std::vector<Bytes>{{0x04, 0x00}}));
+  EXPECT_EQ(SendDriveGone(Gauge()), 1u);  // HID, mode 1: gauge value 1
+  EXPECT_EQ(HidValues("gauge"), (std::vector<Bytes>{{0x01, 0x00}}));
+  EXPECT_EQ(SendDriveGone(Enclosure()), 1u);  // page 0x80, parameter 1
+  EXPECT_EQ(EnclosurePages("enclosure"), (std::vector<Bytes>{{0x80, 0x01}}));
+  EXPECT_NE(Enclosure()->deviceHandle, nullptr) << "enclosures keep their handle";
+
+  ChannelRecord* firewire = FireWire();  // driver, mode 0: state 1
+  EXPECT_EQ(SendDriveGone(firewire), 1u);
+  std::vector<sim::Command> controls = Sent("firewire", Kind::Control);
+  ASSERT_EQ(controls.size(), 1u);
+  EXPECT_EQ(controls[0].code, CTL_SET_STATE);
+  EXPECT_EQ(controls[0].data, (Bytes{0x01, 0x00, 0x00, 0x00}));
+  EXPECT_EQ(firewire->driveGoneSent, 1u);
+  EXPECT_EQ(monitorState.skipTicks, kDriveGoneSkipTicks);
+
+  monitorState.skipTicks = 0;
+  EXPECT_EQ(SendDriveGone(firewire), 0u);
+  EXPECT_EQ(SendDriveGone(nullptr), 0u);
+  EXPECT_EQ(monitorState.skipTicks, 0u) << "a second call changes nothing";
+  EXPECT_EQ(Sent("firewire", Kind::Control).size(), 1u);
+
+  // By drive record: always 1, even when nothing went.
+  ChannelRecord* plain = Plain();
+  DriveRecord drive = CopyOf(plain);
+  drive.channelIndex = plain->ownIndex;
+  EXPECT_EQ(SendDriveGoneFor(&drive, nullptr), 1u);
+  EXPECT_EQ(HidValues("plain").size(), 1u);
+  drive.channelIndex = -1;
+  EXPECT_EQ(SendDriveGoneFor(&drive, nullptr), 1u);
+}
+
+TEST_F(DriveGoneTest, DriverGaugeChannelLosesItsHandleOnlyWhenTheCommandWent) {
+  // A failed send is not repeated either.
+  ChannelRecord* lights = Lights();
+  machine_.FailIo("lights", sim::Endpoint::Driver, ERROR_GEN_FAILURE, 1);
+  EXPECT_EQ(SendDriveGone(lights), 0u);
+  EXPECT_EQ(lights->driveGoneSent, 1u);
+  EXPECT_NE(lights->deviceHandle, nullptr);
+  EXPECT_EQ(SendDriveGone(lights), 0u);
+  EXPECT_EQ(Sent("lights", Kind::Control).size(), 1u);
+
+  // Gauge value 1, then the handle is closed, which ends the channel's worker.
+  lights->driveGoneSent = 0;
+  machine_.ClearCommands();
+  EXPECT_EQ(SendDriveGone(lights), 1u);
+  const std::vector<sim::Command> controls = Sent("lights", Kind::Control);
+  ASSERT_EQ(controls.size(), 1u);
+  EXPECT_EQ(controls[0].code, CTL_SET_GAUGE);
+  EXPECT_EQ(controls[0].data, (Bytes{0x01, 0x00, 0x00, 0x00}));
+  EXPECT_EQ(lights->deviceHandle, nullptr);
+  EXPECT_EQ(machine_.OpenCount("lights", sim::Endpoint::Driver), 0u);
+}
+
+TEST_F(DriveGoneTest, RemovalCheckSkipsAnEnumerationThatFailed) {
+  // Every channel has had a gauge value; a list of disks that cannot be had
+  // says nothing about which drives went.
+  for (int i = 0; i < Block().channelCount; ++i) Block().channels[i].gaugePercentSent = 50;
+  machine_.FailInterfaceList(kDiskInterfaceClass, ERROR_NOT_ENOUGH_MEMORY);
+  EXPECT_EQ(EnumerateDrives(nullptr), kEnumerationFailed);
+  EXPECT_EQ(CheckRemovedDrives(), 0);
+  for (int i = 0; i < Block().channelCount; ++i) EXPECT_EQ(Block().channels[i].driveGoneSent, 0u);
+
+  // Once the list works again, a drive that is no longer listed gets its
+  // command.
+  machine_.FailInterfaceList(kDiskInterfaceClass, 0);
+  machine_.FailOpen("plain", sim::Endpoint::Disk, ERROR_FILE_NOT_FOUND);
+  EXPECT_EQ(CheckRemovedDrives(), 1);
+  EXPECT_EQ(Plain()->driveGoneSent, 1u);
+}
 
 bool NamesFunctionNode(const sim::Machine::EjectRequest& request) {
   return request.instanceId.find("&MI_00\\") != std::string::npos;
