@@ -331,9 +331,6 @@ TEST_F(StatusPagesTest, ADriveThatDoesNotOpenAsksForARescanOnceUnlessNoneCanHelp
   EXPECT_EQ(ReadSleepState(&drive, sleep), 3u);
   EXPECT_EQ(WriteDriveControl(&drive, control), 0xFFFFFFFFu);
   EXPECT_EQ(monitorState.refreshRequests, 1u) << "once while the drive stays so";
-  EXPECT_EQ(monitorState.burstRequested, 1u);
-  EXPECT_EQ(monitorState.gaugePassRequested, 1u);
-  EXPECT_EQ(monitorState.sleepPassRequested, 1u);
 
   // Once the drive opened again, a new failure asks again.
   machine_.ClearFaults();
@@ -413,11 +410,22 @@ TEST_F(ButtonEventTest, AWaitEndsOnAStopOrWithTheErrorOfAVanishedDevice) {
       EXPECT_EQ(Sent(wait.drive, Kind::Control).at(0).code, wait.waitCode);
     }
   }
-  // A press after the stop is kept for the next wait, not lost in a
-  // cancelled one; an enclosure's page is polled: no press, no bits.
+  // A stale drive list is not read again while the workers stop; a polled
+  // page that was read keeps its byte.
+  const LONG drives = Block().driveCount;
+  monitorState.driveListStale = 1;
+  Block().driveCount = 0;
+  machine_.Press("enclosure", 0x04);
+  EXPECT_EQ(ReadButtonEvent(Enclosure()), 0x04);
+  EXPECT_EQ(Block().driveCount, 0);
+  // Otherwise it is, before the event is taken. A press after the stop is
+  // kept for the next wait, not lost in a cancelled one; an enclosure's page
+  // is polled: no press, no bits.
   ResetEvent(monitorState.workerStopEvent);
   machine_.Press("firewire", 0x05);
   EXPECT_EQ(ReadButtonEvent(FireWire()), 0x05);
+  EXPECT_EQ(monitorState.driveListStale, 0u);
+  EXPECT_EQ(Block().driveCount, drives);
   machine_.Press("gauge", 0x04);  // input report 01 04 ...
   EXPECT_EQ(ReadButtonEvent(Gauge()), 0x04);
   machine_.Press("enclosure", 0x01);
@@ -444,79 +452,51 @@ TEST_F(ButtonEventTest, AWaitEndsOnAStopOrWithTheErrorOfAVanishedDevice) {
   EXPECT_EQ(GetLastError(), static_cast<DWORD>(ERROR_INVALID_HANDLE));
 }
 
-TEST_F(ButtonEventTest, StaleDriveListIsReadAgainBeforeTheEventIsTaken) {
-  monitorState.driveListStale = 1;
-  const LONG drives = Block().driveCount;
-  Block().driveCount = 0;
-  machine_.Press("firewire", 0x01);
-  EXPECT_EQ(ReadButtonEvent(FireWire()), 0x01);
-  EXPECT_EQ(monitorState.driveListStale, 0u);
-  EXPECT_EQ(Block().driveCount, drives);
-
-  // Not while the workers stop: the list stays as it is.
-  monitorState.driveListStale = 1;
-  Block().driveCount = 0;
-  SetEvent(monitorState.workerStopEvent);
-  machine_.Press("enclosure", 0x04);
-  EXPECT_EQ(ReadButtonEvent(Enclosure()), 0x04) << "a poll that was read keeps its byte";
-  EXPECT_EQ(monitorState.driveListStale, 1u);
-  EXPECT_EQ(Block().driveCount, 0);
-}
-
 // Workers read identities while the monitor rebuilds the records: the HID
 // identity is stored, and the driver channel's handle read, under the mutex.
+// The driver's identity bytes 88 77 .. 11 are written as hexadecimal within
+// the length given, never into the record; the HID serial string whatever
+// the length, into the record too.
 TEST_F(ButtonEventTest, IdentityReadsWaitForTheStateMutex) {
-  DWORD hid = 0;
-  EXPECT_TRUE(
-      lockprobe::WaitsForTheStateMutex([&] { hid = ReadDriveIdentity(Gauge(), nullptr, 0); }));
-  EXPECT_EQ(hid, 1u);
-  EXPECT_EQ(Narrow(Gauge()->identityText), "374B324139463331");
-  WCHAR buffer[20] = {};
-  EXPECT_TRUE(lockprobe::WaitsForTheStateMutex(
-      [&] { ReadDriveIdentity(FireWire(), reinterpret_cast<BYTE*>(buffer), 34); }));
-  EXPECT_EQ(Narrow(buffer), "1122334455667788");
-}
-
-TEST_F(ButtonEventTest, IdentityIsHexadecimalTextWithinTheLengthAsked) {
-  // The driver's 8 identity bytes 88 77 ... 11, within the length given.
   ChannelRecord* fireWire = FireWire();
+  ChannelRecord* gauge = Gauge();
   WCHAR buffer[128];
+  BYTE* const bytes = reinterpret_cast<BYTE*>(buffer);
   const auto fill = [&] {
     for (WCHAR& unit : buffer) unit = WSTR('#');
   };
   fill();
-  EXPECT_EQ(ReadDriveIdentity(fireWire, reinterpret_cast<BYTE*>(buffer), 34), 0u);
+  DWORD result = 1;
+  EXPECT_TRUE(
+      lockprobe::WaitsForTheStateMutex([&] { result = ReadDriveIdentity(fireWire, bytes, 34); }));
+  EXPECT_EQ(result, 0u);
   EXPECT_EQ(Narrow(buffer), "1122334455667788");
-  EXPECT_EQ(fireWire->identityText[0], 0) << "the record's identity is not written";
+  EXPECT_EQ(fireWire->identityText[0], 0);
   fill();
-  EXPECT_EQ(ReadDriveIdentity(fireWire, reinterpret_cast<BYTE*>(buffer), 10), 0u);
+  EXPECT_EQ(ReadDriveIdentity(fireWire, bytes, 10), 0u);
   EXPECT_EQ(Narrow(buffer), "1122");
   EXPECT_EQ(buffer[5], WSTR('#'));
   fill();
-  EXPECT_EQ(DriveCommand(fireWire, CTL_GET_IDENTITY, reinterpret_cast<BYTE*>(buffer), 1, nullptr),
-            0u);
-  EXPECT_EQ(buffer[0], WSTR('#')) << "a length of 1 writes nothing";
-  EXPECT_EQ(ReadDriveIdentity(Enclosure(), reinterpret_cast<BYTE*>(buffer), 40), 0u);
+  EXPECT_EQ(DriveCommand(fireWire, CTL_GET_IDENTITY, bytes, 1, nullptr), 0u);
+  EXPECT_EQ(ReadDriveIdentity(Enclosure(), bytes, 40), 0u);
   EXPECT_EQ(buffer[0], WSTR('#'));
 
-  // The HID serial string, whatever the length, also into the record.
-  ChannelRecord* gauge = Gauge();
-  EXPECT_EQ(DriveCommand(gauge, CTL_GET_IDENTITY, reinterpret_cast<BYTE*>(buffer), 1, nullptr), 1u);
+  EXPECT_TRUE(lockprobe::WaitsForTheStateMutex(
+      [&] { result = DriveCommand(gauge, CTL_GET_IDENTITY, bytes, 1, nullptr); }));
+  EXPECT_EQ(result, 1u);
   EXPECT_EQ(Narrow(buffer), "374B324139463331");  // "7K2A9F31" as hexadecimal pairs
   EXPECT_EQ(Narrow(gauge->identityText), "374B324139463331");
   EXPECT_EQ(Sent("gauge", Kind::HidSerial).size(), 1u);
 
   machine_.FailOpen("gauge", sim::Endpoint::Hid, ERROR_ACCESS_DENIED, 1);
   gauge->identityText[0] = WSTR('Z');
-  EXPECT_EQ(ReadDriveIdentity(gauge, reinterpret_cast<BYTE*>(buffer), 256), 0u);
+  EXPECT_EQ(ReadDriveIdentity(gauge, bytes, 256), 0u);
   EXPECT_EQ(gauge->identityText[0], WSTR('Z')) << "a failed read changes nothing";
 
   // A collection that never answers is given up when the workers stop.
   machine_.HangIo("gauge", sim::Endpoint::Hid, true);
   SetEvent(monitorState.workerStopEvent);
-  auto hung = std::async(std::launch::async, [&] {
-    return ReadDriveIdentity(gauge, reinterpret_cast<BYTE*>(buffer), 256);
-  });
+  auto hung = std::async(std::launch::async, [&] { return ReadDriveIdentity(gauge, bytes, 256); });
   const bool ended = hung.wait_for(std::chrono::seconds(60)) == std::future_status::ready;
   machine_.HangIo("gauge", sim::Endpoint::Hid, false);
   ASSERT_TRUE(ended) << "a hung HID collection held the worker past its stop";

@@ -350,37 +350,6 @@ TEST_F(ChannelTest, ScanClassifiesEachInterface) {
   }
 }
 
-TEST_F(ChannelTest, AChannelWithoutDiskMakesOneRecordHoweverOftenItBinds) {
-  machine_.AddDrive(HidDrive("usb", "7B44", "2D41"));
-  machine_.FailOpen("usb", sim::Endpoint::Disk, ERROR_ACCESS_DENIED);
-  Install();
-  EnumerateDrives(nullptr);
-  RebuildChannelTable();
-  ASSERT_EQ(Block().driveCount, 0);
-  ASSERT_EQ(Block().channelCount, 1);
-  ChannelRecord& channel = Channel(0);
-  WideCopy(channel.identityText, 128, WSTR("2D41"));
-  std::memcpy(channel.volumeLetters, WSTR("XY"), 4);
-
-  EXPECT_EQ(BindChannelToDrive(&channel, nullptr, 0), -1);  // creation not allowed by the caller
-  EXPECT_EQ(Block().driveCount, 0);
-  EXPECT_EQ(channel.linkedDrive, -1);
-
-  DriveRecord copy{};
-  for (int round = 0; round < 4; ++round) {
-    ASSERT_EQ(BindChannelToDrive(&channel, &copy, 1), 0) << round;
-    EXPECT_EQ(Block().driveCount, 1) << round;
-  }
-  const DriveRecord& drive = Drive(0);
-  EXPECT_EQ(drive.fromChannel, 1u);
-  EXPECT_EQ(N(drive.model), "QX USB HDD");
-  EXPECT_EQ(N(drive.serialNumber), "-A");
-  EXPECT_EQ(N(drive.hidPath), N(channel.devicePath));
-  EXPECT_EQ(channel.linkedDrive, 0);
-  EXPECT_EQ(channel.volumeLetters[0], 0);
-  EXPECT_EQ(std::memcmp(&copy, &drive, sizeof(copy)), 0);
-}
-
 // Records and channels written directly, for the matching rules alone.
 class BindingRulesTest : public DiscoveryTest {
  protected:
@@ -448,6 +417,7 @@ TEST_F(BindingRulesTest, CreatedRecordsNeverShareASlotAndStopAt64) {
   WideCopy(second.identityText, 128, WSTR("4344"));
   EXPECT_EQ(BindChannelToDrive(&second, nullptr, 1), 1);
   EXPECT_EQ(N(Drive(0).serialNumber), "AB");
+  EXPECT_EQ(N(Drive(0).model), "QX USB HDD");
   EXPECT_EQ(N(Drive(1).serialNumber), "CD");
 
   // An IEEE 1394 record keeps the identity text as its serial.
@@ -459,6 +429,16 @@ TEST_F(BindingRulesTest, CreatedRecordsNeverShareASlotAndStopAt64) {
   EXPECT_EQ(N(Drive(2).controlPath), "\\\\?\\control#c");
   EXPECT_EQ(Drive(2).busKind, 3u);
   EXPECT_EQ(Drive(2).recordIndex, 2);
+  EXPECT_EQ(Drive(2).fromChannel, 1u);
+  // Bound again, into a copy, it finds its record; a caller that allows no
+  // creation gets none.
+  DriveRecord copy{};
+  EXPECT_EQ(BindChannelToDrive(&fireWire, &copy, 1), 2);
+  EXPECT_EQ(std::memcmp(&copy, &Drive(2), sizeof(copy)), 0);
+  ChannelRecord refused = MakeChannel(2, 1, WSTR("4546"));
+  WideCopy(refused.devicePath, 256, WSTR("\\\\?\\channel#9"));
+  EXPECT_EQ(BindChannelToDrive(&refused, nullptr, 0), -1);
+  EXPECT_EQ(Block().driveCount, 3);
 
   // The 64th slot holds the enumeration's scratch candidate: replaced whole.
   Block().driveCount = 63;
