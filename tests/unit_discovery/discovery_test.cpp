@@ -10,7 +10,6 @@
 
 #include "discovery/channel_binding.h"
 #include "discovery/channel_scan.h"
-#include "discovery/control_interface.h"
 #include "discovery/disk_number.h"
 #include "discovery/drive_enumeration.h"
 #include "discovery/model_table.h"
@@ -213,47 +212,6 @@ TEST_F(EnumerationTest, SeventyDisksCountSixtyThreeAndKeepTheLastInTheScratchSlo
   for (const WCHAR* text : {scratch.deviceInstanceId, scratch.devicePath}) {
     for (std::size_t i = WideLength(text); i < 256; ++i) ASSERT_EQ(text[i], 0) << i;
   }
-}
-
-TEST_F(EnumerationTest, Windows2000FindsTheControlInterfaceBySerialKey) {
-  sim::DriveSpec first = UsbDrive("first", "7B44", "A1B2C3");
-  first.channel = sim::ChannelKind::Driver;
-  first.driverClass = 3;
-  first.controlInstanceId = "USBSTOR\\OTHER&VEN_QX&PROD_QUARRY\\A1B2C3&0";
-  machine_.AddDrive(first);
-  machine_.AddDrive(EnclosureDrive("enclosure", "0030E00000045D6F", 3));
-  // A USB drive whose control interface is an HID collection of its composite
-  // device; another USB device's collection is listed first.
-  machine_.AddDrive(UsbDrive("usb", "7B44", "C0FFEE12"));
-  const char* const serials[2] = {"BADBEEF0", "C0FFEE12"};
-  for (int i = 0; i < 2; ++i) {
-    const DEVINST composite =
-        machine_.AddNode(machine_.RootNode(), std::string("USB\\VID_1A2B&PID_7B44\\") + serials[i],
-                         "USB Composite Device");
-    const DEVINST function = machine_.AddNode(
-        composite, "USB\\VID_1A2B&PID_7B44&MI_01\\6&" + std::to_string(i) + "&0&0001",
-        "USB Input Device");
-    const DEVINST hid = machine_.AddNode(
-        function, "HID\\VID_1A2B&PID_7B44&MI_01\\7&" + std::to_string(i) + "&0&0000",
-        "HID-compliant device");
-    machine_.AddInterface(hid, sim::kVendorClassC);
-  }
-  Install();
-
-  monitorState.osKind = kOsWindows2000;
-  EnumerateDrives(nullptr);
-  ASSERT_EQ(Block().driveCount, 3);
-  EXPECT_EQ(N(Drive(0).controlPath), PathOf(first.controlInstanceId, kClassCGuid));
-  EXPECT_EQ(N(Drive(1).controlPath),
-            PathOf("SBP2\\QX&QUARRY_SES&LUN1\\0030E00000045D6F", kClassCGuid));
-  EXPECT_EQ(N(Drive(2).controlPath),
-            PathOf("HID\\VID_1A2B&PID_7B44&MI_01\\7&1&0&0000", kClassCGuid));
-
-  // An empty key would be contained in any composite device's ID.
-  WCHAR path[256] = {};
-  EXPECT_EQ(FindControlInterfacePath(kVendorClassC, WSTR(""), path, 256), -1);
-  EXPECT_EQ(path[0], 0);
-  EXPECT_EQ(FindControlInterfacePath(kVendorClassC, WSTR("BADBEEF0"), path, 256), 0);
 }
 
 TEST_F(EnumerationTest, NoDiskLeavesEverythingZero) {

@@ -148,30 +148,6 @@ TEST_F(GaugeTest, EachTransportCarriesThePatternAndOnlyTheDriverSendsZero) {
   EXPECT_EQ(ControlData("lights", CTL_SET_GAUGE), (std::vector<Bytes>{{0, 0, 0, 0}}));
 }
 
-TEST_F(GaugeTest, DriveWithoutVolumesAsksForARescan) {
-  ChannelRecord* lights = Lights();
-  DriveRecord drive = CopyOf(lights);
-  drive.volumeCount = 0;
-  drive.volumeLetters[0] = 0;
-  drive.extendedIdentity = 1;
-  drive.statusCode = 2;  // a drive known to be busy: no rescan
-  UpdateCapacityGauge(&drive, lights, nullptr);
-  EXPECT_EQ(monitorState.refreshRequests, 0u);
-  EXPECT_TRUE(Sent("lights", Kind::Control).empty()) << "0 % used equals the stored 0";
-
-  drive.statusCode = 0;
-  UpdateCapacityGauge(&drive, lights, nullptr);
-  EXPECT_EQ(monitorState.refreshRequests, 1u);
-  // Once it had volumes, losing them again asks again.
-  drive.volumeCount = 1;
-  drive.volumeLetters[0] = WSTR('J');
-  UpdateCapacityGauge(&drive, lights, nullptr);
-  drive.volumeCount = 0;
-  drive.volumeLetters[0] = 0;
-  UpdateCapacityGauge(&drive, lights, nullptr);
-  EXPECT_EQ(monitorState.refreshRequests, 2u);
-}
-
 class DriveGoneTest : public FeatureTest {};
 
 TEST_F(DriveGoneTest, EachChannelGetsItsOwnFormOnce) {
@@ -194,15 +170,6 @@ TEST_F(DriveGoneTest, EachChannelGetsItsOwnFormOnce) {
   EXPECT_EQ(SendDriveGone(nullptr), 0u);
   EXPECT_EQ(monitorState.skipTicks, 0u) << "a second call changes nothing";
   EXPECT_EQ(Sent("firewire", Kind::Control).size(), 1u);
-
-  // By drive record: always 1, even when nothing went.
-  ChannelRecord* plain = Plain();
-  DriveRecord drive = CopyOf(plain);
-  drive.channelIndex = plain->ownIndex;
-  EXPECT_EQ(SendDriveGoneFor(&drive, nullptr), 1u);
-  EXPECT_EQ(HidValues("plain").size(), 1u);
-  drive.channelIndex = -1;
-  EXPECT_EQ(SendDriveGoneFor(&drive, nullptr), 1u);
 
   // A driver channel in gauge mode keeps its handle while the command fails
   // (which is not repeated either), then gets gauge value 1 and loses it.
@@ -424,25 +391,6 @@ TEST_F(SafeRemovalTest, VetoedEjectIsRetriedFourTimesInThreeForms) {
   EXPECT_TRUE(machine_.Attached("enclosure"));
 }
 
-TEST_F(SafeRemovalTest, AMissingFunctionCountsAsAFailedCall) {
-  // The next one is tried.
-  ChannelRecord* gauge = Gauge();
-  machine_.RemoveExport("setupapi.dll", "CM_Request_Device_EjectA");
-  machine_.RemoveExport("setupapi.dll", "CM_Query_And_Remove_SubTreeA");
-  machine_.SetEjectVeto("gauge", PNP_VetoOutstandingOpen, "another program", 1);
-  EXPECT_EQ(Remove(gauge), 1);
-  const auto ejects = machine_.Ejects();
-  ASSERT_EQ(ejects.size(), 2u) << "only the wide query-and-remove, in two attempts";
-  EXPECT_TRUE(ejects[0].queryAndRemove);
-  EXPECT_TRUE(ejects[1].queryAndRemove);
-
-  machine_.RemoveExport("setupapi.dll", "CM_Query_And_Remove_SubTreeW");
-  ChannelRecord* plain = Plain();
-  EXPECT_EQ(Remove(plain), 0);
-  EXPECT_EQ(machine_.Ejects().size(), 2u);
-  EXPECT_TRUE(machine_.Attached("plain"));
-}
-
 // Windows 2000: the two listed models are told of the eject and their USB
 // parent is ejected instead of the storage function.
 using Windows2000RemovalTest = SafeRemovalTest;
@@ -484,26 +432,6 @@ TEST_F(Windows2000RemovalTest, FailedParentEjectReopensTheChannel) {
   EXPECT_EQ(Remove(plain), 0);
   EXPECT_NE(plain->deviceHandle, nullptr);
   EXPECT_EQ(machine_.OpenCount("plain", sim::Endpoint::Hid), 1u);
-}
-
-// The listed model served by the maker's own driver service, with a parent
-// that cannot be surprise-removed.
-class OwnDriverRemovalTest : public SafeRemovalTest {
-  void Customize(std::vector<sim::DriveSpec>* drives) override {
-    (*drives)[1].parentService = "VEVUV_UR";
-    (*drives)[1].parentCapabilities = 0x04;
-  }
-};
-
-TEST_F(OwnDriverRemovalTest, StorageFunctionIsEjectedWithoutNotice) {
-  monitorState.osKind = kOsWindows2000;
-  ChannelRecord* plain = Plain();
-  ASSERT_EQ(Remove(plain), 1);
-  const auto ejects = machine_.Ejects();
-  ASSERT_EQ(ejects.size(), 1u);
-  EXPECT_TRUE(NamesFunctionNode(ejects[0]));
-  EXPECT_TRUE(ejects[0].queryAndRemove) << "capabilities come from the USB parent";
-  for (const Bytes& value : HidValues("plain")) EXPECT_NE(value[0], 0x20);
 }
 
 }  // namespace
