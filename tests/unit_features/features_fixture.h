@@ -1,7 +1,5 @@
-// A machine with a drive of each channel kind and mode, the monitor state a
-// running service has (mutex, working block, stop events), the channel
-// records as a rescan builds them and each channel's shared handle opened as
-// the worker starter opens it. MachineTest is shared with unit_commands;
+// A drive of each channel kind and mode, the monitor state of a running
+// service, the channel records of a rescan with their shared handles open.
 // FeatureTest adds the binding and holds the state mutex.
 #pragma once
 
