@@ -18,10 +18,9 @@ namespace cmdtest {
 using featuretest::Bytes;
 using testsupport::Narrow;
 
-// A machine that keeps every pass-through request block as it is handed to
-// the device, and whose enclosure can be told to keep reporting the removal
-// bit: every read of its event page is preceded by a press, as if the
-// button were held down.
+// A machine that keeps every pass-through request block handed to a device,
+// and whose enclosure button can be held: each read of its event page is
+// preceded by a press.
 class TestMachine : public sim::Machine {
  public:
   struct Request {

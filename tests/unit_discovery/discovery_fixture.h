@@ -20,8 +20,7 @@ inline std::string N(const WCHAR* text) {
   return WideToUtf8(WideView(text, WideLength(text)));
 }
 
-// A USB drive of the maker with every identifier spelled out, so that tests
-// can state what the records must hold without the simulator's derivations.
+// A USB drive with every identifier spelled out, not derived by the simulator.
 inline sim::DriveSpec UsbDrive(const std::string& name, const std::string& modelCode,
                                const std::string& usbSerial) {
   sim::DriveSpec spec;

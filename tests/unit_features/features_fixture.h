@@ -67,11 +67,8 @@ inline sim::DriveSpec FireWireDrive(const std::string& name, sim::ChannelKind ch
   return spec;
 }
 
-// gauge: HID of a standalone gauge model (mode 1), two 1000 MiB volumes with
-// 250 and 750 MiB free; plain: HID of a model outside the channel list (mode
-// 0); firewire: button filter driver (mode 0); lights: button filter driver
-// of a unit with lights (mode 1); enclosure: IEEE 1394 enclosure services
-// (mode 2).
+// Channels of mode 1 (gauge: 1000 MiB volumes E and K, 250 and 750 free;
+// lights: driver), mode 0 (plain: HID; firewire: driver) and 2 (enclosure).
 inline std::vector<sim::DriveSpec> OneDriveOfEachKind() {
   std::vector<sim::DriveSpec> drives = {
       UsbHidDrive("gauge", "7B44", "QX-7K2A9F31", {Volume('E', 1000, 250), Volume('K', 1000, 750)}),

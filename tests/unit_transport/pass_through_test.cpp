@@ -1,8 +1,5 @@
-// The SCSI pass-through transport against a simulated drive: rejected
-// commands, short replies, and the abort of a pending transfer, including a
-// device that is slow to cancel. The replies themselves are pinned by the
-// enumeration's and the status pages' tests, which also check the request
-// blocks.
+// The pass-through transport's failures and aborts; its replies and request
+// blocks are pinned by the enumeration's and the status pages' tests.
 #include "transport/pass_through.h"
 
 #include <gtest/gtest.h>
