@@ -44,11 +44,13 @@ TEST_F(LargeVolumeGaugeTest, UsedSpaceIsSummedInMebibytesOverReadableVolumes) {
     const char* letters;
     DWORD percent;
   } rows[] = {
-      {"E", 17},               // 5 TiB of 30 used
-      {"L", 16},               // 160 MiB of 1000, and 170 on the other side of the first step
-      {"M", 17},  {"LK", 16},  // K cannot be right: left out, the gauge never passes 100 %
-      {"LQ", 16},              // Q cannot be read: left out
-      {"Q", 0},                // no readable volume shows 0 % used
+      {"E", 17},   // 5 TiB of 30 used
+      {"L", 16},   // 160 MiB of 1000
+      {"M", 17},   // 170 MiB: the other side of the first six-segment step
+      {"LM", 17},  // 330 MiB of 2000
+      {"LK", 16},  // K cannot be right: left out, the gauge never passes 100 %
+      {"LQ", 16},  // Q cannot be read: left out
+      {"Q", 0},    // no readable volume shows 0 % used
   };
   for (const auto& row : rows) {
     DriveRecord drive = gauge;
