@@ -350,7 +350,7 @@ TEST_F(BindingRulesTest, KeysMatchWholeComponentsOnly) {
 
 TEST_F(BindingRulesTest, CreatedRecordsNeverShareASlotAndStopAt64) {
   // Channels without a path are never taken for the same channel.
-  ChannelRecord first = MakeChannel(2, 1, WSTR("4142"));
+  ChannelRecord first = MakeChannel(2, 1, WSTR("2D41"));
   first.devicePath[0] = 0;
   ASSERT_EQ(BindChannelToDrive(&first, nullptr, 1), 0);
   ChannelRecord second = first;
@@ -358,7 +358,7 @@ TEST_F(BindingRulesTest, CreatedRecordsNeverShareASlotAndStopAt64) {
   second.linkedDrive = -1;
   WideCopy(second.identityText, 128, WSTR("4344"));
   EXPECT_EQ(BindChannelToDrive(&second, nullptr, 1), 1);
-  EXPECT_EQ(N(Drive(0).serialNumber), "AB");
+  EXPECT_EQ(N(Drive(0).serialNumber), "-A");  // the identity's hexadecimal pairs
   EXPECT_EQ(N(Drive(0).model), "QX USB HDD");
   EXPECT_EQ(N(Drive(1).serialNumber), "CD");
 
