@@ -1,14 +1,16 @@
-// The machine of unit_features' MachineTest with one more HID drive, whose
-// model sends reports with an ID, and an enclosure whose button can be held.
+// The machine of unit_features' MachineTest with one more HID drive, and an
+// enclosure whose button can be held.
 #pragma once
 
 #include <gtest/gtest.h>
 
 #include <atomic>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <vector>
 
+#include "transport/pass_through.h"
 #include "unit_features/features_fixture.h"
 
 namespace cmdtest {
@@ -16,27 +18,38 @@ namespace cmdtest {
 using featuretest::Bytes;
 using testsupport::Narrow;
 
-// A machine whose enclosure can be told to keep reporting the removal bit:
-// every read of its event page is preceded by a press, as if the button were
-// held down.
+// A machine that keeps every pass-through request block handed to a device,
+// and whose enclosure button can be held: each read of its event page is
+// preceded by a press.
 class TestMachine : public sim::Machine {
  public:
+  struct Request {
+    PassThroughRequest block;
+    const void* input;
+    void* output;
+    DWORD inputLength, outputLength;
+  };
   std::atomic<bool> holdEnclosureButton{false};
+  std::mutex requestsLock;
+  std::vector<Request> requests;
 
   std::unique_ptr<emu::DeviceFile> Open(const WCHAR* path, DWORD access, DWORD share, DWORD flags,
                                         DWORD* error) override;
 };
 
-class HeldButtonFile : public emu::DeviceFile {
+class WatchedFile : public emu::DeviceFile {
  public:
-  HeldButtonFile(std::unique_ptr<emu::DeviceFile> inner, TestMachine* machine)
+  WatchedFile(std::unique_ptr<emu::DeviceFile> inner, TestMachine* machine)
       : inner_(std::move(inner)), machine_(machine) {}
   emu::IoStart Control(DWORD code, const void* input, DWORD inputLength, void* output,
                        DWORD outputLength, const emu::IoRequestPtr& request) override {
-    if (machine_->holdEnclosureButton && code == IOCTL_SCSI_PASS_THROUGH_DIRECT &&
-        input != nullptr && inputLength >= sizeof(SCSI_PASS_THROUGH_DIRECT)) {
-      const auto* sptd = static_cast<const SCSI_PASS_THROUGH_DIRECT*>(input);
-      if (sptd->Cdb[0] == 0x1C && sptd->Cdb[2] == 0x80) machine_->Press("enclosure", 0x04);
+    if (code == IOCTL_SCSI_PASS_THROUGH_DIRECT && inputLength >= sizeof(PassThroughRequest)) {
+      const auto* block = static_cast<const PassThroughRequest*>(input);
+      if (machine_->holdEnclosureButton && block->spt.Cdb[0] == 0x1C && block->spt.Cdb[2] == 0x80) {
+        machine_->Press("enclosure", 0x04);
+      }
+      std::lock_guard<std::mutex> lock(machine_->requestsLock);
+      machine_->requests.push_back({*block, input, output, inputLength, outputLength});
     }
     return inner_->Control(code, input, inputLength, output, outputLength, request);
   }
@@ -57,33 +70,17 @@ class HeldButtonFile : public emu::DeviceFile {
 inline std::unique_ptr<emu::DeviceFile> TestMachine::Open(const WCHAR* path, DWORD access,
                                                           DWORD share, DWORD flags, DWORD* error) {
   std::unique_ptr<emu::DeviceFile> file = sim::Machine::Open(path, access, share, flags, error);
-  if (file != nullptr && Narrow(path).find("_ses") != std::string::npos) {
-    return std::make_unique<HeldButtonFile>(std::move(file), this);
-  }
-  return file;
+  if (file == nullptr) return file;
+  return std::make_unique<WatchedFile>(std::move(file), this);
 }
 
 class CommandTest : public featuretest::MachineTest<TestMachine> {
  protected:
   void SetUp() override {
-    using featuretest::FireWireDrive;
-    using featuretest::UsbHidDrive;
-    // gauge: standalone gauge model (mode 1); plain: a model outside the
-    // channel list (mode 0); wide: reports with an ID; firewire and lights:
-    // button filter driver (modes 0 and 1); enclosure: enclosure services.
-    std::vector<sim::DriveSpec> drives = {
-        UsbHidDrive("gauge", "7B44", "QX-7K2A9F31", {sim::VolumeSpec{'E'}}),
-        UsbHidDrive("plain", "2A31", "QX-5M8B2D07", {sim::VolumeSpec{'F'}}),
-        UsbHidDrive("wide", "5E24", "QX-1W2I3D4E", {sim::VolumeSpec{'G'}}),
-        FireWireDrive("firewire", sim::ChannelKind::Driver, "EXTERNAL_HDD", "0030E0000001A2B3",
-                      {sim::VolumeSpec{'H'}}),
-        FireWireDrive("lights", sim::ChannelKind::Driver, "EXTERNAL_LIGHTS", "0030E0000002C4D5",
-                      {sim::VolumeSpec{'J'}}),
-        FireWireDrive("enclosure", sim::ChannelKind::Enclosure, "QUARRY", "0030E00000045D6F",
-                      {sim::VolumeSpec{'I'}}),
-    };
-    drives[3].identity = 0x1122334455667788ull;
-    drives[5].modelCode = "3C13";
+    // The drives of unit_features, and one whose reports carry an ID.
+    std::vector<sim::DriveSpec> drives = featuretest::OneDriveOfEachKind();
+    drives.push_back(featuretest::UsbHidDrive("wide", "5E24", "QX-1W2I3D4E", {}));
+    drives[2].identity = 0x1122334455667788ull;
     Start(drives, 6);
   }
 

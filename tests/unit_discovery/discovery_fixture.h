@@ -1,6 +1,4 @@
-// A working state block and a simulated computer for the discovery tests:
-// each case builds its machine, installs it and runs the discovery passes
-// against it.
+// A working state block and a simulated computer for the discovery tests.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -22,8 +20,7 @@ inline std::string N(const WCHAR* text) {
   return WideToUtf8(WideView(text, WideLength(text)));
 }
 
-// A USB drive of the maker with every identifier spelled out, so that tests
-// can state what the records must hold without the simulator's derivations.
+// A USB drive with every identifier spelled out, not derived by the simulator.
 inline sim::DriveSpec UsbDrive(const std::string& name, const std::string& modelCode,
                                const std::string& usbSerial) {
   sim::DriveSpec spec;
@@ -38,6 +35,14 @@ inline sim::DriveSpec UsbDrive(const std::string& name, const std::string& model
   spec.diskPath = "\\\\?\\usbstor#disk&ven_qx&prod_external_hdd&rev_0100#" + usbSerial +
                   "&0#{53f56307-b6bf-11d0-94f2-00a0c91efb8b}";
   spec.friendlyName = "QX External HDD USB Device";
+  return spec;
+}
+
+inline sim::DriveSpec HidDrive(const std::string& name, const std::string& modelCode,
+                               const std::string& usbSerial) {
+  sim::DriveSpec spec = UsbDrive(name, modelCode, usbSerial);
+  spec.channel = sim::ChannelKind::Hid;
+  spec.hidInstanceId = "HID\\VID_1A2B&PID_" + modelCode + "&MI_01\\7&" + usbSerial + "&0&0000";
   return spec;
 }
 
@@ -77,6 +82,14 @@ class DiscoveryTest : public ::testing::Test {
   void Install() {
     machine_.Install();
     installed_ = true;
+  }
+
+  // The stored channel whose device has this instance ID, or null.
+  ChannelRecord* ChannelOf(const std::string& instanceId) {
+    for (LONG i = 0; i < Block().channelCount; ++i) {
+      if (N(Channel(i).deviceInstanceId) == instanceId) return &Channel(i);
+    }
+    return nullptr;
   }
 
   StateBlock& Block() { return *block_; }

@@ -1,7 +1,5 @@
-// A machine with a drive of each channel kind and mode, the monitor state a
-// running service has (mutex, working block, stop events), the channel
-// records as a rescan builds them and each channel's shared handle opened as
-// the worker starter opens it. MachineTest is shared with unit_commands;
+// A drive of each channel kind and mode, the monitor state of a running
+// service, the channel records of a rescan with their shared handles open.
 // FeatureTest adds the binding and holds the state mutex.
 #pragma once
 
@@ -69,11 +67,8 @@ inline sim::DriveSpec FireWireDrive(const std::string& name, sim::ChannelKind ch
   return spec;
 }
 
-// gauge: HID of a standalone gauge model (mode 1), two 1000 MiB volumes with
-// 250 and 750 MiB free; plain: HID of a model outside the channel list (mode
-// 0); firewire: button filter driver (mode 0); lights: button filter driver
-// of a unit with lights (mode 1); enclosure: IEEE 1394 enclosure services
-// (mode 2).
+// Channels of mode 1 (gauge: 1000 MiB volumes E and K, 250 and 750 free;
+// lights: driver), mode 0 (plain: HID; firewire: driver) and 2 (enclosure).
 inline std::vector<sim::DriveSpec> OneDriveOfEachKind() {
   std::vector<sim::DriveSpec> drives = {
       UsbHidDrive("gauge", "7B44", "QX-7K2A9F31", {Volume('E', 1000, 250), Volume('K', 1000, 750)}),
@@ -110,7 +105,7 @@ class MachineTest : public ::testing::Test {
     AssignVolumeLetters();
     RebuildChannelTable();
     ASSERT_EQ(Block().channelCount, channels);
-    for (int i = 0; i < channels; ++i) OpenShared(&Block().channels[i]);
+    for (int i = 0; i < channels; ++i) testsupport::OpenSharedChannelHandle(&Block().channels[i]);
     machine_.ClearCommands();
   }
 
@@ -125,7 +120,6 @@ class MachineTest : public ::testing::Test {
     monitorState = MonitorState{};
   }
 
-  static void OpenShared(ChannelRecord* channel) { testsupport::OpenSharedChannelHandle(channel); }
   StateBlock& Block() { return *block_; }
   ChannelRecord* Channel(const std::string& part) {
     return testsupport::FindChannel(Block(), part);
@@ -174,10 +168,6 @@ class FeatureTest : public MachineTest<sim::Machine> {
       ASSERT_GE(BindChannelToDrive(&channel, nullptr, 0), 0) << Narrow(channel.devicePath);
       ASSERT_GE(channel.linkedDrive, 0);
     }
-    monitorState.refreshRequests = 0;
-    monitorState.burstRequested = 0;
-    monitorState.gaugePassRequested = 0;
-    monitorState.sleepPassRequested = 0;
     machine_.ClearCommands();
   }
 
@@ -197,6 +187,14 @@ class FeatureTest : public MachineTest<sim::Machine> {
     std::vector<Bytes> out;
     for (const sim::Command& c : Sent(drive, Kind::HidOutput)) {
       out.push_back(Bytes(c.data.begin() + 1, c.data.begin() + 3));
+    }
+    return out;
+  }
+  // Data of one button-filter-driver control the drive got, in order.
+  std::vector<Bytes> ControlData(const std::string& drive, DWORD code) {
+    std::vector<Bytes> out;
+    for (const sim::Command& c : Sent(drive, Kind::Control)) {
+      if (c.code == code) out.push_back(c.data);
     }
     return out;
   }
