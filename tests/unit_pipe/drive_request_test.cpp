@@ -1,6 +1,3 @@
-// Commands 11 and 12 against a drive of a simulated computer: the drive is
-// named by the key in the client's image, but every path opened is the
-// service's own.
 #include <gtest/gtest.h>
 
 #include <cstring>
@@ -54,11 +51,8 @@ class DriveRequestTest : public pipetest::MonitorFixture {
   sim::Machine machine_;
 };
 
-// The drive's key with a pipe of the test's own in every path of the image:
-// the service must neither connect to the pipe nor fail to reach the drive.
-// A path of the image once made the service open it as the local system
-// account: a share made the machine authenticate to it, a pipe handed its
-// server a client it could impersonate.
+// Commands 11 and 12 take only the drive's key from the client's image: its
+// paths, once opened, handed a pipe's server the system account to impersonate.
 TEST_F(DriveRequestTest, PathsOfTheImageAreNeverOpened) {
   const WideString decoy = Utf8ToWide("\\\\.\\pipe\\" + skytest::UniqueStem("decoy"));
   Handle server(CreateNamedPipeW(decoy.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
@@ -71,8 +65,6 @@ TEST_F(DriveRequestTest, PathsOfTheImageAreNeverOpened) {
   ASSERT_FALSE(ConnectNamedPipe(server.Get(), &overlapped));
   ASSERT_EQ(GetLastError(), static_cast<DWORD>(ERROR_IO_PENDING));
 
-  // The drive as the application sees it in the shared block, with a path of
-  // its own choosing in each path field.
   DriveRecord image = Block().drives[0];
   image.modelSuffixRef = nullptr;
   image.productLineRef = nullptr;
@@ -99,7 +91,6 @@ TEST_F(DriveRequestTest, PathsOfTheImageAreNeverOpened) {
     } else {
       EXPECT_EQ(answer.result, ERROR_SUCCESS);
     }
-    // The drive itself was reached through the service's record.
     EXPECT_FALSE(machine_.Commands("usb").empty()) << command;
     EXPECT_EQ(WaitForSingleObject(connected.Get(), 0), static_cast<DWORD>(WAIT_TIMEOUT))
         << "command " << command << " connected to the image's pipe";

@@ -5,8 +5,6 @@
 
 #include "pipe/pipe_server.h"
 
-// The client's quality-of-service flags are the system's own values (checked
-// where the system headers define them).
 #if defined(SECURITY_SQOS_PRESENT)
 static_assert(kPipeClientSecurityFlags == (SECURITY_SQOS_PRESENT | SECURITY_IDENTIFICATION));
 #endif
@@ -26,7 +24,10 @@ void MonitorFixture::TearDown() {
 
 void ServerFixture::SetUp() {
   MonitorFixture::SetUp();
-  if (HasFatalFailure()) return;
+  if (!HasFatalFailure()) StartServer();
+}
+
+void ServerFixture::StartServer() {
   thread_.Reset(CreateThread(nullptr, 0, PipeServerThread, nullptr, 0, nullptr));
   ASSERT_TRUE(thread_.Valid());
 }
@@ -49,8 +50,7 @@ bool ServerFixture::StopServer() {
 }
 
 Handle ServerFixture::Connect() {
-  // Until the thread has created the first instance the name does not exist;
-  // after that a busy pipe is waited for by OpenCommandPipe itself.
+  // The name exists once the thread created its first instance.
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(kGuardMs);
   for (;;) {
     HANDLE pipe = OpenCommandPipe(kGuardMs);

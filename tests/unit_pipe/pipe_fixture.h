@@ -1,6 +1,3 @@
-// The command channel's surroundings as the monitor sets them up: a zeroed
-// state block, its mutex and mapping, and the pipe stop event; optionally the
-// pipe server thread itself. Plus client helpers for the tests.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -22,7 +19,6 @@ namespace pipetest {
 using skytest::Handle;
 using skytest::kGuardMs;
 
-// The monitor's state with the pipe stop event (no server thread).
 class MonitorFixture : public ::MonitorFixture {
  protected:
   void SetUp() override;
@@ -30,25 +26,21 @@ class MonitorFixture : public ::MonitorFixture {
   StateBlock& Block() { return *monitorState.stateBlock; }
 };
 
-// The same with the pipe server thread running.
 class ServerFixture : public MonitorFixture {
  protected:
   void SetUp() override;
   void TearDown() override;
-
-  // Signals the stop event and waits for the thread; true when it ended with
-  // exit code 0.
+  void StartServer();
+  // True when the thread ended on the stop event with exit code 0.
   bool StopServer();
   // A connected client; waits for the server to listen (guarded).
   Handle Connect();
 
- private:
   Handle thread_;
 };
 
-// One exchange on a connected client. `sent` bytes of `request` go out as one
-// message; the reply (possibly empty) comes back. ok is false when the write
-// or the read failed (error then holds the last error).
+// One message of `sent` bytes out, the reply (possibly empty) back; error is
+// the last error when ok is false.
 struct Exchange {
   bool ok = false;
   DWORD error = 0;
@@ -60,7 +52,6 @@ struct Exchange {
 Exchange Send(HANDLE client, const void* request, DWORD sent);
 Exchange Send(HANDLE client, const CommandMessage& message);
 
-// A fresh full-length request on the heap.
 std::unique_ptr<CommandMessage> NewCommand(DWORD command, DWORD arg1 = 0, DWORD arg2 = 0,
                                            DWORD arg3 = 0);
 

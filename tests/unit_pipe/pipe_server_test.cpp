@@ -1,6 +1,3 @@
-// The pipe server and dispatcher against real clients: message lengths,
-// instance limits, clients that leave early, stopping, and the commands that
-// need no drive, as the shared block shows them afterwards.
 #include "pipe/pipe_server.h"
 
 #include <gtest/gtest.h>
@@ -32,7 +29,7 @@ class PipeServerTest : public pipetest::ServerFixture {
  protected:
   DWORD PublishedStatus() { return MappedCopy()->statusWord; }
   DWORD PublishedSequence() { return MappedCopy()->sequence; }
-  // The monitor's fields, read or written as the monitor does: under the mutex.
+  // Under the mutex, as the monitor reads and writes them.
   template <typename F>
   DWORD Locked(F f) {
     WaitForSingleObject(monitorState.stateMutex, INFINITE);
@@ -52,9 +49,8 @@ Exchange SendDeclared(HANDLE client, DWORD command, DWORD arg1, std::uint64_t de
   return Send(client, request.data(), sent);
 }
 
-// Served requests answer at their declared length and are published before the
-// reply; a length outside the range gets an empty reply, changes nothing and
-// keeps the connection; codes outside the table answer -777 and still publish.
+// A length outside the range gets an empty reply, changes nothing and keeps
+// the connection; codes outside the table answer -777 and still publish.
 TEST_F(PipeServerTest, RequestsAreServedAtTheirDeclaredLengthOrNotAtAll) {
   Handle client = Connect();
   ASSERT_TRUE(client);
@@ -104,29 +100,21 @@ TEST_F(PipeServerTest, RequestsAreServedAtTheirDeclaredLengthOrNotAtAll) {
 TEST_F(PipeServerTest, EmptyOrOverlongMessageDisconnectsThatClientOnly) {
   Handle bystander = Connect();
   ASSERT_TRUE(bystander);
-  {
+  for (DWORD sent : {kCommandMaxLength + 1, 0u}) {
     Handle client = Connect();
     ASSERT_TRUE(client);
-    EXPECT_FALSE(
-        SendDeclared(client.Get(), kCommandSetStatus, 11, kCommandMaxLength, kCommandMaxLength + 1)
-            .ok);
+    EXPECT_FALSE(SendDeclared(client.Get(), kCommandSetStatus, 11, kCommandMaxLength, sent).ok)
+        << sent;
   }
-  {
-    Handle client = Connect();
-    ASSERT_TRUE(client);
-    EXPECT_FALSE(Send(client.Get(), "", 0).ok);
-  }
-  // The bystander's request publishes the working copy, which never took the
-  // status of the dropped requests.
+  // The bystander's request publishes the working copy.
   Exchange reply = Send(bystander.Get(), *NewCommand(4));
   EXPECT_TRUE(reply.ok);
   EXPECT_EQ(reply.Result(), kCommandUnknownResult);
   EXPECT_NE(PublishedStatus(), 11u);
 }
 
-// Clients that leave before their reply leave their instances reusable; there
-// are fifteen, and no room for someone else's instance (which would receive
-// the service's clients); the sixteenth client waits for a leaver.
+// Early leavers free their instances; there are fifteen, and no room for
+// someone else's instance, which would receive the service's clients.
 TEST_F(PipeServerTest, FifteenInstancesServeAgainAfterClientsLeftEarly) {
   std::vector<Handle> clients;
   clients.push_back(Connect());
@@ -163,8 +151,7 @@ TEST_F(PipeServerTest, FifteenInstancesServeAgainAfterClientsLeftEarly) {
   }
 }
 
-// Any account may open the mutex and keep it; a request then waits for it,
-// and the stop must still end the thread with clients connected.
+// Any account may keep the mutex; the stop must still end the thread.
 TEST_F(PipeServerTest, StopEndsTheThreadWithClientsConnectedAndTheMutexHeld) {
   Handle idle = Connect();
   Handle served = Connect();
@@ -175,13 +162,11 @@ TEST_F(PipeServerTest, StopEndsTheThreadWithClientsConnectedAndTheMutexHeld) {
   auto request = NewCommand(kCommandSetStatus, 9);
   DWORD written = 0;
   ASSERT_TRUE(WriteFile(waiting.Get(), request.get(), sizeof(CommandMessage), &written, nullptr));
-  // Lets the server reach its wait for the mutex; the outcome does not depend
-  // on it, only whether the case meets that wait.
+  // Only whether the case meets the server's wait for the mutex depends on it.
   Sleep(50);
   EXPECT_TRUE(StopServer());
   ReleaseMutex(monitorState.stateMutex);
   EXPECT_NE(MappedCopy()->statusWord, 9u) << "the request ran after the stop";
-  // The instances are gone: a connected client's read fails, the name is free.
   std::vector<BYTE> buffer(kCommandMaxLength);
   DWORD read = 0;
   EXPECT_FALSE(ReadFile(idle.Get(), buffer.data(), kCommandMaxLength, &read, nullptr));
@@ -189,12 +174,13 @@ TEST_F(PipeServerTest, StopEndsTheThreadWithClientsConnectedAndTheMutexHeld) {
       CreateFileW(kPipeName, GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING, 0, nullptr)));
 }
 
-class PipeNameTakenTest : public pipetest::MonitorFixture {};
+class PipeNameTakenTest : public pipetest::ServerFixture {
+  void SetUp() override { MonitorFixture::SetUp(); }
+};
 
 TEST_F(PipeNameTakenTest, ServerLogsAHeldNameAndServesOnceItIsFree) {
   SKIP_ON_WINE("Wine 8 ignores FILE_FLAG_FIRST_PIPE_INSTANCE and creates the second instance");
-  // Spare instances allowed, so only the first-instance flag can keep the
-  // service from joining this pipe.
+  // Spare instances allowed: only the first-instance flag keeps the service out.
   Handle squatter(CreateNamedPipeW(kPipeName, PIPE_ACCESS_DUPLEX,
                                    PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT,
                                    PIPE_UNLIMITED_INSTANCES, 4096, 4096, 0, nullptr));
@@ -202,9 +188,8 @@ TEST_F(PipeNameTakenTest, ServerLogsAHeldNameAndServesOnceItIsFree) {
 #ifndef _WIN32
   emu::ClearEventLog();
 #endif
-  Handle thread(CreateThread(nullptr, 0, PipeServerThread, nullptr, 0, nullptr));
-  ASSERT_TRUE(thread);
-  EXPECT_EQ(WaitForSingleObject(thread.Get(), 100), static_cast<DWORD>(WAIT_TIMEOUT));
+  StartServer();
+  EXPECT_EQ(WaitForSingleObject(thread_.Get(), 100), static_cast<DWORD>(WAIT_TIMEOUT));
   squatter.Reset();
   Handle client;
   for (int attempt = 0; attempt < 100 && !client; ++attempt) {
@@ -222,14 +207,9 @@ TEST_F(PipeNameTakenTest, ServerLogsAHeldNameAndServesOnceItIsFree) {
   }
   EXPECT_EQ(reports, 1u) << "a held name is logged once";
 #endif
-  SetEvent(monitorState.pipeStopEvent);
-  ASSERT_EQ(WaitForSingleObject(thread.Get(), skytest::kGuardMs), WAIT_OBJECT_0);
-  DWORD code = 1;
-  EXPECT_TRUE(GetExitCodeThread(thread.Get(), &code));
-  EXPECT_EQ(code, 0u);
+  EXPECT_TRUE(StopServer());
 }
 
-// Pause, resume and the drive commands with no drive to act on.
 TEST_F(PipeServerTest, PauseRefusesSafeRemovalAndDriveCommandsWithoutADriveFail) {
   Handle client = Connect();
   ASSERT_TRUE(client);
@@ -253,7 +233,7 @@ TEST_F(PipeServerTest, PauseRefusesSafeRemovalAndDriveCommandsWithoutADriveFail)
   EXPECT_EQ(Send(client.Get(), *NewCommand(kCommandReleaseDrive, 0)).Result(), 0u);
   EXPECT_EQ(PublishedStatus(), 102u);
 
-  // The one drive in the block has a key that is only a prefix of the one named.
+  // The block's one drive has a key that is only a prefix of the one named.
   Locked([this] {
     Block().driveCount = 1;
     return static_cast<DWORD>(WideCopy(Block().drives[0].firmwareSerial, 64, WSTR("NO-SUCH")));
@@ -266,9 +246,8 @@ TEST_F(PipeServerTest, PauseRefusesSafeRemovalAndDriveCommandsWithoutADriveFail)
   EXPECT_EQ(Send(client.Get(), *read).Result(), static_cast<DWORD>(ERROR_INVALID_PARAMETER));
 }
 
-// Before major version 6 the pipe's DACL denies the network logon SID, then
-// allows everyone, in that order; from 6 on it is null and the mode refuses
-// remote clients. Either way a pipe created with it serves a local client.
+// Before version 6 the DACL denies network logons, then allows everyone; from
+// 6 on it is null and the mode refuses remote clients.
 TEST(PipeSecurityTest, NetworkDeniedBeforeVersionSixRemoteFlagFromSix) {
   PSID network = nullptr;
   PSID everyone = nullptr;

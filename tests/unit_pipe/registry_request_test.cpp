@@ -1,6 +1,5 @@
-// Registry access of command 13: the outcomes the registry gives, and the
-// refusals that keep a client's offsets, lengths and root key from reaching
-// beyond what it sent or into the service's own handles.
+// Command 13: a client's offsets, lengths and root key never reach beyond
+// what it sent or into the service's own handles.
 #include <gtest/gtest.h>
 
 #include <cstring>
@@ -20,7 +19,6 @@ namespace {
 
 using pipetest::NewCommand;
 
-// A key of this case's own below HKEY_CURRENT_USER\Software, removed at the end.
 class RegistryRequestTest : public pipetest::MonitorFixture {
  protected:
   RegistryRequestTest() {
@@ -32,7 +30,6 @@ class RegistryRequestTest : public pipetest::MonitorFixture {
   }
   ~RegistryRequestTest() override { RegDeleteKeyW(HKEY_CURRENT_USER, path_.c_str()); }
 
-  // A full-length command 13 message for this case's key.
   std::unique_ptr<CommandMessage> Request(const char* name, DWORD operation, DWORD type,
                                           const void* data, DWORD dataLength) {
     auto message = NewCommand(kCommandRegistry);
@@ -41,8 +38,7 @@ class RegistryRequestTest : public pipetest::MonitorFixture {
     return message;
   }
 
-  // Runs the request with `available` bytes delivered from the request's start
-  // (all of the message by default).
+  // `available` bytes delivered from the request's start.
   static DWORD Run(CommandMessage* message,
                    std::size_t available = sizeof(CommandMessage) - kRegistryRequestOffset) {
     return RunRegistryRequest(reinterpret_cast<BYTE*>(&message->registry), available);
@@ -93,7 +89,6 @@ TEST_F(RegistryRequestTest, OutcomesOfSetQueryAndOtherOperations) {
   EXPECT_EQ(query->registry.valueType, static_cast<DWORD>(REG_BINARY));
   EXPECT_EQ(std::memcmp(RegistryData(query.get()), data.data(), 100), 0);
 
-  // A small area gives more-data and the size needed.
   EXPECT_EQ(Run(Request("Big", kRegistrySet, REG_BINARY, data.data(), 300).get()), ERROR_SUCCESS);
   auto small = Request("Big", kRegistryQuery, REG_NONE, nullptr, 10);
   EXPECT_EQ(Run(small.get()), static_cast<DWORD>(ERROR_MORE_DATA));
@@ -103,14 +98,12 @@ TEST_F(RegistryRequestTest, OutcomesOfSetQueryAndOtherOperations) {
   EXPECT_EQ(Run(absent.get()), static_cast<DWORD>(ERROR_FILE_NOT_FOUND));
   EXPECT_EQ(absent->registry.dataLength, 64u) << "the request's own length stays";
 
-  // Any other operation only opens the key.
   EXPECT_EQ(Run(Request("Untouched", 2, REG_BINARY, data.data(), 8).get()), ERROR_SUCCESS);
   EXPECT_FALSE(HasValue("Untouched"));
 }
 
 TEST_F(RegistryRequestTest, RootKeyMustBePredefined) {
-  // A key handle that is valid inside this very process must still be refused:
-  // a number from a client never becomes a handle of the service.
+  // A number from a client never becomes a handle of the service.
   HKEY own = nullptr;
   ASSERT_EQ(RegOpenKeyExW(HKEY_CURRENT_USER, WSTR("Software"), 0, KEY_ALL_ACCESS, &own),
             ERROR_SUCCESS);
@@ -132,8 +125,7 @@ TEST_F(RegistryRequestTest, RootKeyMustBePredefined) {
   RegCloseKey(own);
   EXPECT_FALSE(HasValue("Refused"));
 
-  // Each root as a 64-bit client sends it and in the zero-extended 32-bit
-  // form a 32-bit client sends.
+  // Each root as 64-bit and 32-bit (zero-extended) clients send it.
   for (HKEY root : {HKEY_CLASSES_ROOT, HKEY_CURRENT_USER, HKEY_LOCAL_MACHINE, HKEY_USERS,
                     HKEY_CURRENT_CONFIG}) {
     for (std::uint64_t value : {RootKeyValue(root), RootKeyValue(root) & 0xFFFFFFFFu}) {
@@ -149,8 +141,6 @@ TEST_F(RegistryRequestTest, RootKeyMustBePredefined) {
   EXPECT_TRUE(HasValue("Narrow")) << "the 32-bit form reached another key";
 }
 
-// Offsets and lengths against the bytes delivered: each case is laid out in a
-// full message and then cut or pointed past the end.
 TEST_F(RegistryRequestTest, TextsAndDataMustLieInsideTheBytesDelivered) {
   const std::vector<BYTE> data = Pattern(16);
   auto base = Request("Edge", kRegistrySet, REG_BINARY, data.data(), 16);
@@ -195,12 +185,10 @@ TEST_F(RegistryRequestTest, TextsAndDataMustLieInsideTheBytesDelivered) {
   }
   EXPECT_FALSE(HasValue("Edge"));
 
-  // Exactly enough bytes: the data area ends on the last byte delivered.
   EXPECT_EQ(Run(base.get(), dataEnd), ERROR_SUCCESS);
   DWORD type = 0;
   EXPECT_EQ(ReadValue("Edge", &type), data);
 
-  // A data area that ends on the very last byte of the message.
   auto tail = Request("Tail", kRegistrySet, REG_BINARY, nullptr, 0);
   const std::size_t room =
       sizeof(tail->registryText) -
@@ -211,8 +199,7 @@ TEST_F(RegistryRequestTest, TextsAndDataMustLieInsideTheBytesDelivered) {
   EXPECT_EQ(ReadValue("Tail", &type), std::vector<BYTE>(room, 0x5A));
 }
 
-// Through the dispatcher: what counts is what the client delivered and
-// declared, whichever is less.
+// Through the dispatcher: the less of what was delivered and declared counts.
 using RegistryDispatchTest = RegistryRequestTest;
 
 TEST_F(RegistryDispatchTest, BytesNotDeliveredOrBeyondTheDeclaredLengthAreRefused) {
@@ -234,12 +221,9 @@ TEST_F(RegistryDispatchTest, BytesNotDeliveredOrBeyondTheDeclaredLengthAreRefuse
     std::memcpy(&result, reply.data() + offsetof(CommandMessage, result), sizeof(result));
     return result;
   };
-  // The data's last byte did not arrive, although the message declares it.
   EXPECT_EQ(dispatch(static_cast<DWORD>(dataEnd - 1), kCommandMaxLength),
             static_cast<DWORD>(ERROR_INVALID_PARAMETER));
   EXPECT_FALSE(HasValue("Cut"));
-  // It arrived, though beyond the length the message declares: what arrived
-  // bounds the request.
   if (dataEnd > kCommandMinLength) {
     EXPECT_EQ(dispatch(kCommandMaxLength, dataEnd - 1), ERROR_SUCCESS);
     EXPECT_TRUE(HasValue("Cut"));
