@@ -1,5 +1,3 @@
-// The monitor loop run whole, scripted from its pass hook, which runs on the
-// monitor thread between passes, so the sequence of passes is deterministic.
 #include <atomic>
 #include <memory>
 #include <string>
@@ -19,15 +17,12 @@ using monitorrun::Pass;
 using MonitorLoop = monitorrun::MonitorRun;
 
 TEST_F(MonitorLoop, WithoutDrivesPublishesEveryFifthTickAndStopsCleanly) {
-  // What an earlier run in this process may have left behind: a new run
-  // starts from a clean state.
+  // Left behind by an earlier run: a new run starts from a clean state.
   monitorState.paused = 1;
   monitorState.skipTicks = 7;
   monitorState.tick = 2999;
-  // Threads are checked after every case by the test main's leak check.
   const long handles = platform::LiveHandleCount();
   Run([](const std::vector<Pass>& passes) { return passes.size() == 23; });
-  // The stop is noticed at the top of the next pass and leaves nothing behind.
   const std::vector<Pass>& passes = passes_;
   ASSERT_EQ(passes.size(), 23u) << "a pass ran after the stop";
   EXPECT_EQ(monitorState.stateBlock, nullptr);
@@ -39,17 +34,12 @@ TEST_F(MonitorLoop, WithoutDrivesPublishesEveryFifthTickAndStopsCleanly) {
         << "no publish in the five ticks before pass " << i;
   }
   EXPECT_EQ(passes.back().tick, 24u);
-  // The first rescan ended with 102; the last publish is the stop's 500.
   EXPECT_EQ(passes.front().statusWord, 102u);
-  ASSERT_FALSE(published_.empty());
-  EXPECT_EQ(published_.back(), 500u);
+  EXPECT_EQ(LastPublished(), 500u);
 }
 
-// One run through the requests that take passes of their own, each made
-// after the previous one settled: ten skipped ticks, a device change with a
-// stale list, a worker restart then a removal check, the tick's wrap from 3000
-// to 1, a refresh, and a pause, which freezes the tick and ends by itself
-// after sixty passes with a refresh.
+// Each request that takes passes of its own, made after the previous one
+// settled; the pause ends by itself after sixty passes with a refresh.
 TEST_F(MonitorLoop, PauseFreezesTheTickAndEndsAfterSixtyPassesWithARescan) {
   std::size_t publishesBefore = 0;
   Run([this, &publishesBefore](const std::vector<Pass>& passes) {
@@ -84,8 +74,7 @@ TEST_F(MonitorLoop, PauseFreezesTheTickAndEndsAfterSixtyPassesWithARescan) {
   });
   const std::vector<Pass>& passes = passes_;
   ASSERT_EQ(passes.size(), 85u);
-  // S skipped, D device change, W workers restart, C removal check. The flags
-  // become a refresh on a pass that does not sleep or advance the tick; one
+  // The flags become a refresh on a pass that does not advance the tick; one
   // refresh is one rescan on the next regular tick.
   const std::string kinds = "RSSSSSSSSSSRDRRWCRRRRRRR" + std::string(60, 'P') + "R";
   const DWORD ticks[] = {0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1, 1, 2, 3, 3, 3, 4, 5};
@@ -100,7 +89,6 @@ TEST_F(MonitorLoop, PauseFreezesTheTickAndEndsAfterSixtyPassesWithARescan) {
                                        : (i < 84 ? 4u : 5u));
     EXPECT_EQ(passes[i].rescans, passes[0].rescans + (i < 24 ? rescans[i] : i < 84 ? 3 : 4));
   }
-  // The refresh is published as 101, then 102 when its rescan ends.
   std::vector<DWORD> after(published_.begin() + static_cast<long>(publishesBefore),
                            published_.end());
   ASSERT_GE(after.size(), 3u);
@@ -111,8 +99,6 @@ TEST_F(MonitorLoop, PauseFreezesTheTickAndEndsAfterSixtyPassesWithARescan) {
 }
 
 TEST_F(MonitorLoop, AProgramThatKeepsTheMutexCannotKeepTheStopFromEnding) {
-  // Any account may open the named mutex and keep it; the service's threads
-  // (monitor, workers) then wait for it until the stop bounds their waits.
   std::atomic<bool> taken{false};
   std::atomic<bool> release{false};
   std::thread holder;
@@ -131,12 +117,11 @@ TEST_F(MonitorLoop, AProgramThatKeepsTheMutexCannotKeepTheStopFromEnding) {
   });
   release = true;
   holder.join();
-  EXPECT_NE(published_.back(), 500u) << "the block was written without the mutex";
+  EXPECT_NE(LastPublished(), 500u) << "the block was written without the mutex";
   EXPECT_EQ(monitorState.stateMutex, nullptr);
 }
 
 TEST_F(MonitorLoop, ExistingSharedObjectsAreUsedAndOutliveTheService) {
-  // The application may create the objects first.
   HANDLE mutex = CreateMutexW(nullptr, FALSE, kStateMutexName);
   HANDLE mapping = CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0,
                                       kStateBlockSize, kFileMapName);
@@ -157,9 +142,7 @@ TEST_F(MonitorLoop, ExistingSharedObjectsAreUsedAndOutliveTheService) {
   CloseHandle(mutex);
 }
 
-// A stop asked for before the run ends it at once and reaches the application;
-// it is used up, so the next run goes on until stopped. A start-up that fails
-// tears down what it made without running the loop.
+// An early stop is used up by the run it ends.
 TEST_F(MonitorLoop, EarlyStopOrFailedStartUpEndsTheRunBeforeItsFirstPass) {
   skytest::Handle uiStop(CreateEventW(nullptr, FALSE, FALSE, kUiStopEventName));
   ASSERT_TRUE(uiStop);
@@ -170,7 +153,6 @@ TEST_F(MonitorLoop, EarlyStopOrFailedStartUpEndsTheRunBeforeItsFirstPass) {
   Run([](const std::vector<Pass>& passes) { return passes.size() == 2; });
   EXPECT_EQ(passes_.size(), 2u);
 
-  // An event already holds the mapping's name, so the mapping cannot be made.
   skytest::Handle squatter(CreateEventW(nullptr, TRUE, FALSE, kFileMapName));
   ASSERT_TRUE(squatter);
   passes_.clear();
@@ -183,7 +165,6 @@ TEST_F(MonitorLoop, EarlyStopOrFailedStartUpEndsTheRunBeforeItsFirstPass) {
 }
 
 TEST_F(MonitorLoop, PlantedSmallMappingIsReportedOnceAndReplacedWhenFreed) {
-  // Someone created the name first, too small for the block.
   HANDLE planted =
       CreateFileMappingW(INVALID_HANDLE_VALUE, nullptr, PAGE_READWRITE, 0, 4096, kFileMapName);
   ASSERT_NE(planted, nullptr);
@@ -200,8 +181,7 @@ TEST_F(MonitorLoop, PlantedSmallMappingIsReportedOnceAndReplacedWhenFreed) {
   ASSERT_EQ(passes.size(), 16u);
   EXPECT_EQ(passes[7].sequence, 0u) << "something was published into the small mapping";
   EXPECT_GT(passes.back().sequence, 0u) << "the service did not take the name back";
-  ASSERT_FALSE(published_.empty());
-  EXPECT_EQ(published_.back(), 500u);
+  EXPECT_EQ(LastPublished(), 500u);
   std::size_t reports = 0;
   for (const emu::EventLogEntry& entry : emu::EventLogEntries()) {
     for (const std::u16string& text : entry.strings) {
@@ -215,10 +195,8 @@ TEST_F(MonitorLoop, StopDuringAForwardedResumeWithAHungWorkerEndsWith500) {
   Install(Load());
   Start(nullptr);
   ASSERT_TRUE(WaitUntil([this] { return PassCount() >= 1; }));
-  // The loop idles, so that only the rescan meets the device below.
+  // The loop idles, so that only the rescan's worker start meets the hung device.
   Set(&MonitorState::skipTicks, 1000000);
-  // The enclosure's worker reads its identity from the enclosure device at
-  // start; from now on that read never completes.
   machine_->HangIo("enclosure", sim::Endpoint::Enclosure, true);
   machine_->ClearCommands();
   std::thread client([] {
@@ -245,13 +223,11 @@ TEST_F(MonitorLoop, StopDuringAForwardedResumeWithAHungWorkerEndsWith500) {
   Finish();
   client.join();
   ASSERT_TRUE(hung) << "the rescan never reached the enclosure";
-  ASSERT_FALSE(published_.empty());
-  EXPECT_EQ(published_.back(), 500u) << "a command published after the stop";
+  EXPECT_EQ(LastPublished(), 500u) << "a command published after the stop";
 }
 
-// A forwarded resume may start workers before the start-up rescan runs; a
-// rescan while workers run stops them first (the leak check finds the
-// channel handles of workers it did not stop).
+// A forwarded resume may start workers before the start-up rescan (the leak
+// check finds the channel handles of workers the rescan did not stop).
 TEST_F(MonitorLoop, RescanWhileWorkersRunStopsThemFirst) {
   Install(Load());
   Start(nullptr);
@@ -267,12 +243,12 @@ TEST_F(MonitorLoop, RescanWhileWorkersRunStopsThemFirst) {
 
 TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
   Install(Load());
-  // The firewire drive answers a status that keeps it out of the published
-  // list; its record keeps the index 0 of another drive's copy.
+  // Kept out of the published list, the firewire record keeps the index 0 of
+  // another drive's copy.
   const std::uint8_t notPublishable[4] = {0x4A, 0x00, 0x00, 0x00};
   machine_->SetStatus("firewire", notPublishable);
-  // Per pass, each published drive's copy and own record as "code/level".
-  std::vector<std::vector<std::string>> copies, records;
+  // Per pass, each published drive's copy and own record as (code, level).
+  std::vector<std::vector<std::pair<DWORD, LONG>>> copies, records;
   Run([&](const std::vector<Pass>& passes) {
     StateLock lock;
     const StateBlock* block = monitorState.stateBlock;
@@ -282,10 +258,8 @@ TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
       const DriveRecord& copy = block->published[p];
       const DriveRecord& own = block->drives[copy.recordIndex];
       EXPECT_NE(copy.statusCode, 4u) << "pass " << passes.size();
-      copies.back().push_back(std::to_string(copy.statusCode) + "/" +
-                              std::to_string(copy.statusLevel));
-      records.back().push_back(std::to_string(own.statusCode) + "/" +
-                               std::to_string(own.statusLevel));
+      copies.back().emplace_back(copy.statusCode, copy.statusLevel);
+      records.back().emplace_back(own.statusCode, own.statusLevel);
     }
     return passes.size() == 12;
   });
@@ -293,8 +267,8 @@ TEST_F(MonitorLoop, StatusPassWritesOnlyIntoTheCopyOfTheSameDrive) {
   ASSERT_FALSE(copies.back().empty());
   EXPECT_EQ(copies, records);
   // Every published drive answered its status page: a level of 0 to 3.
-  for (const std::string& drive : copies.back()) {
-    EXPECT_TRUE(drive.size() == 3 && drive[2] >= '0' && drive[2] <= '3') << drive;
+  for (const auto& [code, level] : copies.back()) {
+    EXPECT_TRUE(code < 10 && level >= 0 && level <= 3) << code << "/" << level;
   }
 }
 

@@ -1,8 +1,5 @@
-// RunMonitor on a thread of its own, scripted from its pass hook: after every
-// pass the script runs on the monitor thread (mutex released), sees every
-// pass so far, may change the monitor's flags (under the mutex), and returns
-// true to stop the monitor. Cases copy out what they check there, since the
-// block is freed when the monitor ends.
+// RunMonitor on a thread of its own, scripted from its pass hook: the script
+// runs on the monitor thread after every pass and returns true to stop it.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -28,17 +25,9 @@
 
 namespace monitorrun {
 
-// One-second passes take 10 ms; set before the emulation's first wait.
-inline const bool kTimeScaled = [] {
-  setenv("SKYVANE_TIME_SCALE", "0.01", 0);
-  return true;
-}();
-
 // A guard against a run that never reaches its goal: 3000 passes of 10 ms.
 constexpr std::size_t kMaxPasses = 3000;
 
-// The monitor's state after one pass (per channel: linked, pendingAction,
-// lightMarker; per drive: fromChannel).
 struct Pass {
   PassKind kind = PassKind::Regular;
   DWORD tick = 0, sequence = 0, statusWord = 0, rescans = 0;
@@ -52,7 +41,6 @@ using Script = std::function<bool(const std::vector<Pass>&)>;
 class MonitorRun : public ::testing::Test {
  protected:
   void SetUp() override {
-    ASSERT_TRUE(kTimeScaled);
     InitializeProcessLocks();
     debugMode = true;  // no service control manager: status reports are skipped
     active = this;
@@ -74,7 +62,6 @@ class MonitorRun : public ::testing::Test {
       machine_->Uninstall();
     }
   }
-  // Runs the monitor until the script stops it.
   void Run(Script script) {
     Start(std::move(script));
     Finish();
@@ -86,8 +73,7 @@ class MonitorRun : public ::testing::Test {
       finished_ = true;
     });
   }
-  // Waits for RunMonitor to return; a monitor that never stops ends the
-  // program, since its thread cannot be joined.
+  // A monitor that never stops ends the program: its thread cannot be joined.
   void Finish() {
     if (!WaitUntil([this] { return finished_.load(); }, 60)) {
       std::fprintf(stderr, "the monitor did not stop\n");
@@ -97,7 +83,6 @@ class MonitorRun : public ::testing::Test {
     finished_ = false;
     EXPECT_LT(passes_.size(), kMaxPasses) << "the run did not reach its goal";
   }
-  // Waits (real time, guarded) until `done` holds.
   static bool WaitUntil(const std::function<bool()>& done, int seconds = 20) {
     const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(seconds);
     while (!done()) {
@@ -106,6 +91,7 @@ class MonitorRun : public ::testing::Test {
     }
     return true;
   }
+  DWORD LastPublished() { return published_.empty() ? 0 : published_.back(); }
   std::size_t PassCount() {
     std::lock_guard<std::mutex> guard(lock_);
     return passes_.size();

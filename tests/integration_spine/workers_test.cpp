@@ -1,5 +1,3 @@
-// The whole monitor with its channel workers, on the embedded default machine
-// and on machines whose drives are all of channel models.
 #include <atomic>
 #include <chrono>
 #include <memory>
@@ -18,7 +16,6 @@ using monitorrun::Pass;
 
 class WorkersTest : public monitorrun::MonitorRun {
  protected:
-  // Commands of one control code that the drive received.
   std::vector<sim::Command> Controls(const std::string& drive, DWORD code) const {
     std::vector<sim::Command> out;
     for (const sim::Command& c : machine_->Commands(drive)) {
@@ -26,15 +23,13 @@ class WorkersTest : public monitorrun::MonitorRun {
     }
     return out;
   }
-  // The start-up rescan ran and the drive's worker waits for an event.
   bool Waiting(const std::vector<Pass>& passes, const char* drive,
                sim::Endpoint endpoint = sim::Endpoint::Driver) const {
     return passes.back().rescans >= 1 && machine_->PendingCount(drive, endpoint) >= 1;
   }
 };
 
-// Only drives of channel models: a button-filter-driver drive and an
-// enclosure, both IEEE 1394.
+// Only drives of channel models: a driver-channel drive and an enclosure.
 std::unique_ptr<sim::Machine> CountedMachine(const std::string& more = "") {
   std::string text(sim::DefaultMachineText());
   const std::size_t gauge = text.find("# USB drive of a standalone gauge model");
@@ -45,8 +40,7 @@ std::unique_ptr<sim::Machine> CountedMachine(const std::string& more = "") {
   return monitorrun::MonitorRun::Load(text + more);
 }
 
-// Settled, then a panel event: the plain drive is not of a channel model, so
-// the counted-drives check reports it (100) and holds back the panel actions.
+// The plain drive is not of a channel model: a panel event reports it (100).
 TEST_F(WorkersTest, DefaultMachineLinksEveryChannelAndStaysSettled) {
   Install(Load());
   std::size_t settled = 0;  // passes before the press
@@ -68,11 +62,9 @@ TEST_F(WorkersTest, DefaultMachineLinksEveryChannelAndStaysSettled) {
     EXPECT_EQ(s.statusWord, 102u);
     EXPECT_EQ(s.driveCount, 4) << "no drive record may be made from a channel";
     ASSERT_EQ(s.channelCount, 4);
-    // gauge HID, plain HID, firewire driver, enclosure: drives 0 to 3.
     EXPECT_EQ(s.linked, (std::vector<LONG>{0, 1, 2, 3}));
     EXPECT_EQ(s.fromChannel, (std::vector<DWORD>{0, 0, 0, 0}));
   }
-  // The start commands each worker gives its channel, once.
   for (std::size_t count : startCommands) EXPECT_EQ(count, 1u);
   std::size_t serialQueries = 0;
   for (const sim::Command& c : machine_->Commands()) {
@@ -83,9 +75,7 @@ TEST_F(WorkersTest, DefaultMachineLinksEveryChannelAndStaysSettled) {
 }
 
 TEST_F(WorkersTest, DrivesThatStayIncompleteAskForOneRescanAtMost) {
-  // bare: linked to its HID channel, no volume and no extended identity, so
-  // every gauge pass finds it without letters. loose: extended identity, no
-  // channel and no control path, so no status pass can open it.
+  // bare: a gauge drive without letters; loose: no path a status pass can open.
   std::string text(sim::DefaultMachineText());
   text += R"(
 drive bare
@@ -124,14 +114,14 @@ TEST_F(WorkersTest, PanelEventsOnAControlChannelLightTheDriveAndSetTheAction) {
           step = 1;
         }
         return false;
-      case 1:  // the reply was sent; the marker now holds further replies back
+      case 1:  // the marker now holds further replies back
         if (!Controls("firewire", CTL_EVENT_REPLY).empty() && waiting) {
           machine_->Press("firewire", 0x01);
           machine_->Press("firewire", 0x02);
           step = 2;
         }
         return false;
-      default:  // both events handled, in order
+      default:
         return now.channelCount >= 1 && now.pendingAction[0] == 5;
     }
   });
@@ -145,11 +135,8 @@ TEST_F(WorkersTest, PanelEventsOnAControlChannelLightTheDriveAndSetTheAction) {
   EXPECT_EQ(last.rescans, 1u);
 }
 
-// Removals refused once by the system are reported with the drive's index
-// (control channel: drive 0, storage channel: drive 1). Then the whole path of
-// a removal: the control worker dismounts the drive's volume, the eject
-// succeeds, the channel ends with the device, and the refresh it asks for
-// rebuilds the block without the drive.
+// Refused removals name the drive (600, 601); then a removal dismounts the
+// volume, ejects, and the refresh rebuilds the block without the drive.
 TEST_F(WorkersTest, EjectButtonRemovesTheDriveAndTheRescanForgetsIt) {
   Install(CountedMachine());
   machine_->SetEjectVeto("firewire", PNP_VetoOutstandingOpen, "test");
@@ -196,9 +183,8 @@ TEST_F(WorkersTest, EjectButtonRemovesTheDriveAndTheRescanForgetsIt) {
 }
 
 TEST_F(WorkersTest, RemovalFailingAfterTheDriveWentNamesTheDriveTheWorkerLinked) {
-  // Ejecting the gauge drive's disk leaves its HID channel in place, unlinked
-  // (a model that makes no drive record of its own); a second removal
-  // request on it then fails and names drive 0 all the same.
+  // The gauge drive's HID channel stays, unlinked, after its disk went; a
+  // second removal on it fails and names drive 0 all the same.
   std::string text(sim::DefaultMachineText());
   const std::size_t model = text.find("model-code 7B44");
   ASSERT_NE(model, std::string::npos);
@@ -224,9 +210,8 @@ TEST_F(WorkersTest, RemovalFailingAfterTheDriveWentNamesTheDriveTheWorkerLinked)
 }
 
 TEST_F(WorkersTest, DriveGoneFromAnotherThreadLeavesTheHandleToItsWorker) {
-  // A driver channel in gauge mode ends with the drive-gone command. Its
-  // worker is blocked in a read on a device that never completes a cancel:
-  // only the worker can give that read up, so it must be the one to close.
+  // The worker is blocked in a read whose cancel never completes: only it can
+  // give that read up, so it must be the one to close.
   Install(CountedMachine(R"(
 drive lights
   bus 1394
@@ -257,8 +242,6 @@ end
       return step != 1;
     }
     if (passes.back().endedWorkers == 0) return false;
-    // The read the worker gave up completes now; the monitor's teardown
-    // frees what it left behind.
     machine_->FinishHeldCancels();
     return true;
   });
@@ -268,9 +251,7 @@ end
 }
 
 TEST_F(WorkersTest, AStatusReadThatTheEnclosureNeverAnswersEndsOnItsTimeOutOrAStop) {
-  // The enclosure stops answering while the monitor reads its status page
-  // with the mutex held. The read is given up after the device time-out, so
-  // the passes go on; and a stop ends a read at once.
+  // A status read under the mutex ends on the device time-out or a stop.
   Install(Load());
   std::atomic<bool> monitorEnded{false};
   std::atomic<int> passesAfterAsk{-1};
@@ -281,8 +262,7 @@ TEST_F(WorkersTest, AStatusReadThatTheEnclosureNeverAnswersEndsOnItsTimeOutOrASt
     machine_->HangIo("enclosure", sim::Endpoint::Enclosure, true);
     machine_->ClearCommands();
     stopper = std::thread([&] {
-      // Two status reads (page 0x82) asked for: the first was given up, and
-      // the stop comes while the second is pending.
+      // The stop comes while the second status read (page 0x82) is pending.
       std::size_t asked = 0;
       for (int i = 0; i < 4000 && asked < 2; ++i) {
         asked = 0;
@@ -294,7 +274,6 @@ TEST_F(WorkersTest, AStatusReadThatTheEnclosureNeverAnswersEndsOnItsTimeOutOrASt
       }
       EXPECT_EQ(asked, 2u) << "the first read never ended";
       StopMonitor();
-      // A hang guard only: the stop takes a cancellation grace at most.
       for (int i = 0; i < 2000 && !monitorEnded; ++i) {
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
       }
