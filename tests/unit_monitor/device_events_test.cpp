@@ -20,7 +20,6 @@ Requests Current() {
           monitorState.deviceChangePending, monitorState.removalCheckRequested};
 }
 
-// A device-interface record with a name long enough for the name tests.
 struct InterfaceEvent {
   DEV_BROADCAST_DEVICEINTERFACE_W header;
   WCHAR rest[64];
@@ -37,10 +36,6 @@ InterfaceEvent Interface(const GUID& interfaceClass, WideView name = WSTR("\\\\?
 
 class DeviceEvents : public MonitorFixture {
  protected:
-  DeviceEvents() {
-    volume_.dbch_size = sizeof(volume_);
-    volume_.dbch_devicetype = DBT_DEVTYP_VOLUME;
-  }
   Requests Handle(DWORD type, const void* record) {
     const Requests before = Current();
     HandleDeviceEvent(type, record, nullptr);
@@ -48,13 +43,12 @@ class DeviceEvents : public MonitorFixture {
     return {after.refreshRequests - before.refreshRequests, after.driveListStale,
             after.deviceChangePending, after.removalCheckRequested};
   }
-  DEV_BROADCAST_HDR volume_ = {};
+  DEV_BROADCAST_HDR volume_ = {sizeof(DEV_BROADCAST_HDR), DBT_DEVTYP_VOLUME, 0};
   const InterfaceEvent disk_ = Interface(kDiskInterfaceClass);
   const InterfaceEvent usb_ = Interface(kUsbDeviceInterfaceClass);
 };
 
-// Each row: the event, its record, and what it asks for (refreshes added,
-// then the three flags), starting from clear flags.
+// Each row: refreshes added, then the three flags, from clear flags.
 TEST_F(DeviceEvents, EachEventAsksForWhatItsKindNeeds) {
   GUID hidClass;
   ASSERT_TRUE(GetHidClassGuid(&hidClass));
@@ -96,7 +90,6 @@ TEST_F(DeviceEvents, EachEventAsksForWhatItsKindNeeds) {
   }
 }
 
-// The flags are the monitor's: every path that sets them waits for the mutex.
 TEST_F(DeviceEvents, FlagsAreSetUnderTheStateMutex) {
   const std::pair<DWORD, const void*> events[] = {{DBT_DEVICEREMOVECOMPLETE, &volume_},
                                                   {DBT_DEVICEREMOVECOMPLETE, &disk_},

@@ -1,6 +1,6 @@
-// Whether a call waits for a lock that the calling test holds: run on a thread
-// of its own, it must not return within 200 ms (real time) and must return
-// once the lock is given up; a call that skips the lock fails the check.
+// Whether a call, run on a thread of its own, waits for a lock that the test
+// holds: it must not return within 200 ms (real time), and must once `release`
+// (which runs in every case) gives the lock up.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -16,7 +16,6 @@
 
 namespace lockprobe {
 
-// `release` gives up the lock this thread holds; it runs in every case.
 inline ::testing::AssertionResult WaitsForTheHeldLock(const std::function<void()>& call,
                                                       const std::function<void()>& release) {
   std::promise<void> returned;
@@ -35,7 +34,6 @@ inline ::testing::AssertionResult WaitsForTheHeldLock(const std::function<void()
   return ::testing::AssertionFailure() << "returned while the lock was held";
 }
 
-// The same for the state mutex, or one of the process's critical sections.
 inline ::testing::AssertionResult WaitsForTheStateMutex(const std::function<void()>& call) {
   if (WaitForSingleObject(monitorState.stateMutex, INFINITE) != WAIT_OBJECT_0) {
     return ::testing::AssertionFailure() << "cannot take the state mutex";

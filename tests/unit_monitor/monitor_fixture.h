@@ -1,5 +1,3 @@
-// The monitor state of monitor_setup.h around each case, and a way to read
-// what the mapping holds.
 #pragma once
 
 #include <gtest/gtest.h>

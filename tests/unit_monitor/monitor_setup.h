@@ -1,6 +1,5 @@
-// The monitor state RunMonitor would set up (mutex, working block, unnamed
-// mapping) for code that calls single functions: the monitor unit tests and
-// the publish figure of the benchmark. No test framework here.
+// The monitor state RunMonitor would set up, for the unit tests and the
+// benchmark's publish figure. No test framework here.
 #pragma once
 
 #include <cstdlib>
@@ -9,7 +8,6 @@
 #include "platform/win32.h"
 #include "service/process_locks.h"
 
-// True when the mutex, the block and the mapping were all created.
 inline bool OpenMonitorState() {
   InitializeProcessLocks();
   monitorState = MonitorState{};

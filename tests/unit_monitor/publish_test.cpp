@@ -9,9 +9,8 @@ namespace {
 
 using Publish = MonitorFixture;
 
-// Copies only when needed or forced, whole and byte for byte except the row
-// references (addresses of the service never leave it); a failed view loses
-// only that publish.
+// Byte for byte except the row references: the service's addresses never
+// leave it. A failed view loses only that publish.
 TEST_F(Publish, CopiesTheWholeBlockOnlyWhenNeededOrForced) {
   static const WCHAR row[] = WSTR("row");
   StateBlock* block = monitorState.stateBlock;
@@ -100,7 +99,6 @@ TEST_F(Publish, PublishedListSkipsDrivesWithoutExtendedIdentityOrStatusPage) {
   BuildPublishedList(block);
   EXPECT_EQ(block->publishedCount, 0);
   EXPECT_EQ(block->published[3].busKind, 0u) << "published array must be cleared";
-  // Not polled: untouched.
   EXPECT_EQ(block->drives[0].statusLevel, 2);
   EXPECT_EQ(block->drives[0].publishedIndex, 7);
   // Polled, but no reachable drive returns page 0x82 here.

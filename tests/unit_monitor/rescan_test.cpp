@@ -13,7 +13,6 @@ class Rescan : public MonitorFixture {
     MonitorFixture::SetUp();
     ResetWorkerState();
     StateBlock* block = monitorState.stateBlock;
-    // What an earlier enumeration and scan would have left behind.
     block->driveCount = 2;
     block->drives[0].gaugePercent = 40;
     block->drives[1].gaugePercent = 75;
@@ -26,10 +25,8 @@ class Rescan : public MonitorFixture {
   }
 };
 
-// Forwarded power messages: suspend forgets the gauges and stops the workers
-// without a rescan, resume rebuilds everything; other messages change nothing,
-// and a forwarded device change is classified without reading its record
-// (the second parameter points into the application's memory).
+// Suspend forgets the gauges and stops the workers, resume rebuilds all; a
+// forwarded device change's record (the application's memory) is never read.
 TEST_F(Rescan, ForwardedMessagesSuspendResumeOrClassify) {
   StateBlock* block = monitorState.stateBlock;
   HandleForwardedMessage(0x218, 5, 0, nullptr);
@@ -53,7 +50,6 @@ TEST_F(Rescan, ForwardedMessagesSuspendResumeOrClassify) {
     EXPECT_EQ(monitorState.rescanCount, before + 1) << resume;
     EXPECT_EQ(block->statusWord, 102u);
     EXPECT_EQ(monitorState.rescanInProgress, 0u);
-    // No drive and no channel is present here: the rebuilt tables are empty.
     EXPECT_EQ(block->driveCount, 0);
     EXPECT_EQ(block->channelCount, 0);
     EXPECT_EQ(block->channels[0].linkedDrive, -1);
@@ -68,7 +64,7 @@ TEST_F(Rescan, ForwardedMessagesSuspendResumeOrClassify) {
 }
 
 TEST_F(Rescan, RemovalCheckCutShortByAStopSendsNoDriveGone) {
-  // The enumeration aborted by the stop finds no drive; that is no removal.
+  // The enumeration aborted by the stop finds no drive: that is no removal.
   HANDLE stop = CreateEventW(nullptr, TRUE, TRUE, nullptr);
   ASSERT_NE(stop, nullptr);
   monitorState.stopEvent = stop;
@@ -81,9 +77,9 @@ TEST_F(Rescan, RemovalCheckCutShortByAStopSendsNoDriveGone) {
   CloseHandle(stop);
 }
 
-// A restart takes the locks a quiesce takes: never amid a quiesce.
 TEST_F(Rescan, RestartWaitsForARescanOrQuiesceInProgress) {
-  // Waiting for the rescan lock, it holds none of the locks taken after it.
+  // A restart never runs amid a rescan or quiesce, and waits holding no lock
+  // taken after the rescan lock.
   bool mutexFree = false;
   EnterCriticalSection(&rescanLock);
   EXPECT_TRUE(lockprobe::WaitsForTheHeldLock(
