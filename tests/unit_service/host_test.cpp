@@ -1,5 +1,3 @@
-// The host's pieces that need no service manager: verbs, error texts, and the
-// locks the control handler takes.
 #include <gtest/gtest.h>
 
 #include <utility>
@@ -20,8 +18,6 @@ Verb Parse(std::vector<WideString> words) {
   return ParseVerb(static_cast<int>(words.size()), argv.data());
 }
 
-// A verb is the first argument, "-" or "/" and the whole word in any case;
-// anything else falls through to the dispatcher.
 TEST(Verbs, OnlyAWholePrefixedFirstWordIsAVerb) {
   const std::pair<std::vector<WideString>, Verb> cases[] = {
       {{WSTR("-install")}, Verb::Install},
@@ -54,8 +50,7 @@ std::string TextFor(DWORD error, DWORD bufferBytes) {
 }
 
 // The system text without its line break, then the code in hex; empty when
-// the text does not fit in the buffer's size in bytes less 14 or there is no
-// text; cut to the buffer and terminated when it fits only that margin.
+// there is no text or it does not fit in the buffer's bytes less 14.
 TEST(LastErrorText, SystemTextThenHexCodeWithinTheBuffer) {
   const std::string text = TextFor(ERROR_SERVICE_EXISTS, 256);
   ASSERT_GT(text.size(), 8u);
@@ -67,7 +62,6 @@ TEST(LastErrorText, SystemTextThenHexCodeWithinTheBuffer) {
   const std::size_t textLength = text.size() - 8 + 2;
   EXPECT_EQ(TextFor(ERROR_SERVICE_EXISTS, static_cast<DWORD>(textLength + 13)), "");
   EXPECT_NE(TextFor(ERROR_SERVICE_EXISTS, static_cast<DWORD>(textLength + 14)), "");
-  // A buffer of exactly as many bytes as the text leaves one unit short.
   WCHAR buffer[128];
   for (WCHAR& unit : buffer) unit = 'x';
   SetLastError(ERROR_SERVICE_EXISTS);
@@ -76,8 +70,7 @@ TEST(LastErrorText, SystemTextThenHexCodeWithinTheBuffer) {
   EXPECT_EQ(buffer[text.size()], 'x') << "wrote beyond the stated buffer size";
 }
 
-// The handler passes a device event on only under the lock whose holder ends
-// the notifications, and reads the state to report under the status lock.
+// Device events pass under the lock whose holder ends the notifications.
 TEST(ServiceControlHandler, EventsAndReportsWaitForTheirLocks) {
   InitializeProcessLocks();
   const bool saved = debugMode;
@@ -88,8 +81,6 @@ TEST(ServiceControlHandler, EventsAndReportsWaitForTheirLocks) {
   EXPECT_TRUE(lockprobe::WaitsForTheSection(&deviceEventLock, [] {
     ServiceControlHandler(SERVICE_CONTROL_DEVICEEVENT, DBT_DEVICEARRIVAL, nullptr, nullptr);
   }));
-  // The state reported is read under the status lock: a change its holder
-  // makes meanwhile is the one reported.
   debugMode = false;
   serviceStatus.dwCurrentState = SERVICE_RUNNING;
   EnterCriticalSection(&serviceStatusLock);

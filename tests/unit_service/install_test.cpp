@@ -1,4 +1,3 @@
-// The verbs against the emulated service database and dispatcher.
 #include <thread>
 
 #include "service_test_support.h"
@@ -35,7 +34,6 @@ constexpr const char* kUsage =
     "\nStartServiceCtrlDispatcher being called.\n"
     "This may take several seconds.  Please wait.\n";
 
-// Which words are verbs is the parser's table; here each outcome's output.
 TEST_F(VerbCommands, NonVerbPrintsUsageAndTriesTheDispatcher) {
   EXPECT_EQ(EntryOutput({"install"}), kUsage);
   const std::vector<emu::EventLogEntry> log = emu::EventLogEntries();
@@ -72,7 +70,6 @@ TEST_F(VerbCommands, RemoveStopsARunningServiceFirst) {
   ASSERT_TRUE(emu::WaitForDispatcherReturn());
   service.join();
   emu::EndServiceSession();
-  // "Stopping" is followed by one dot per further second of stop-pending.
   EXPECT_EQ(output.rfind("Stopping Skyvane Service.", 0), 0u) << output;
   const std::string tail = "\nSkyvane Service stopped.\nSkyvane Service removed.\n";
   ASSERT_GE(output.size(), tail.size());

@@ -1,10 +1,7 @@
-// Shared pieces of the host service cases: a scaled clock, the entry run on a
-// thread of its own, and captured console output.
 #pragma once
 
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <string>
 #include <vector>
 
@@ -14,13 +11,6 @@
 
 namespace servicetest {
 
-// The loop's one-second passes take 10 ms; set before the first wait.
-inline const bool kTimeScaled = [] {
-  setenv("SKYVANE_TIME_SCALE", "0.01", 0);
-  return true;
-}();
-
-// Runs ServiceEntry with the given words after the program name.
 inline int RunEntry(std::vector<std::string> words) {
   std::vector<WideString> storage{WSTR("SkyvaneSvc")};
   for (const std::string& word : words) storage.push_back(Utf8ToWide(word));
@@ -30,7 +20,6 @@ inline int RunEntry(std::vector<std::string> words) {
   return ServiceEntry(static_cast<int>(storage.size()), argv.data());
 }
 
-// ServiceEntry's console output for the given words.
 inline std::string EntryOutput(std::vector<std::string> words) {
   ::testing::internal::CaptureStdout();
   EXPECT_EQ(RunEntry(std::move(words)), 0);
