@@ -1,6 +1,4 @@
 #!/bin/sh
-# The host executable in -debug in one process, the status client in others,
-# sharing a private emulation namespace and registry.
 set -u
 SVC=$1
 CLIENT=$2
@@ -10,8 +8,6 @@ export SKYVANE_TIME_SCALE=0.1
 
 start_service
 live_block
-# The embedded default machine has four of the maker's drives, each with one
-# control channel.
 [ "$(field driveCount "$WORK/live.json")" -ge 4 ] || fail "driveCount"
 [ "$(field channelCount "$WORK/live.json")" = 4 ] || fail "channelCount"
 

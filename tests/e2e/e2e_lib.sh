@@ -1,7 +1,5 @@
-# Plumbing shared by the end-to-end scripts (sourced; POSIX sh): a work
-# directory removed at the end, the service in the foreground form, a client
-# that holds the state block, and failure reports that show what was written.
-# Before sourcing: SVC and CLIENT; RUN=w to run the programs under Wine.
+# Sourced by the end-to-end scripts (POSIX sh). Before sourcing: SVC and
+# CLIENT; RUN=w to run the programs under Wine.
 WORK=$(mktemp -d)
 SVC_PID=
 HOLDER_PID=
@@ -23,14 +21,13 @@ fail() {
   for f in "$WORK"/*.txt "$WORK"/*.json; do [ -f "$f" ] && { echo "--- $f"; cat "$f"; }; done
   exit 1
 }
-# A private emulation namespace and registry (host runs).
 private_emulation() {
   export SKYVANE_NAMESPACE="$1-$$"
   export SKYVANE_REGISTRY="$WORK/registry"
 }
 client() { $RUN "$CLIENT" "$@"; }
 field() { sed -n "s/^  \"$1\": \([0-9]*\),*\r*$/\1/p" "$2"; }
-# within TENTHS COMMAND...: true once the command succeeds, polled every 0.1 s.
+# within TENTHS COMMAND...: polled every 0.1 s.
 within() {
   n=$1
   shift
@@ -46,14 +43,12 @@ start_service() {
   $RUN "$SVC" -debug >"$WORK/service.txt" 2>&1 &
   SVC_PID=$!
 }
-# Interrupts the foreground service; it must end within TENTHS with code 0.
 stop_service() {
   kill -INT "$SVC_PID"
   within "${1:-600}" eval '! running $SVC_PID' || fail "the service did not stop"
   wait "$SVC_PID" || fail "service exit code $?"
   SVC_PID=
 }
-# The block reaches status word 102 with its size, and its sequence grows.
 live_block() {
   client status --json --wait-open --wait-status 102 --timeout-ms 60000 >"$WORK/live.json" \
     2>"$WORK/live.txt" || fail "no block with statusWord 102"
@@ -62,7 +57,6 @@ live_block() {
   client status --json --wait-sequence $((seq + 1)) --timeout-ms 30000 >"$WORK/next.json" 2>&1 ||
     fail "sequence did not grow past $seq"
 }
-# A client that keeps the mapping open until it shows status word 500.
 start_holder() {
   $RUN "$CLIENT" status --json --wait-open --wait-status 500 --timeout-ms 90000 >"$WORK/last.json" \
     2>"$WORK/holder.txt" &

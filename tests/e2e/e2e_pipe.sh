@@ -1,9 +1,5 @@
 #!/bin/sh
-# End to end over the command channel: the service runs in the foreground in
-# one process, the command-line client talks to it from others.
-#
-#   e2e_pipe.sh host SERVICE CLIENT     (POSIX emulation; private namespace and registry)
-#   e2e_pipe.sh wine SERVICE.exe CLIENT.exe   (under Wine, in $WINEPREFIX)
+# e2e_pipe.sh host|wine SERVICE CLIENT: the command channel end to end.
 set -u
 SVC=$2
 CLIENT=$3
@@ -19,11 +15,10 @@ if [ "$RUN" = wine ]; then
 else
   private_emulation e2epipe
 fi
-# The client's output goes through a file: a helper process that Wine starts
-# along with a program (the device host, for one) may inherit the program's
-# standard output and hold a pipe open long after the program has ended.
+# Output through a file: a helper process Wine starts may inherit the
+# client's standard output and hold a pipe open long after the client ended.
 ask() { timeout 60 $RUN "$CLIENT" "$@" >"$WORK/client.txt" 2>&1; }
-# expect RC TEXT ARGS...: the client exits with RC and its output holds TEXT.
+# expect RC TEXT ARGS...
 expect() {
   want=$1
   text=$2
@@ -41,7 +36,6 @@ answers() {
 
 start_service
 within 600 answers || fail "the service's pipe never answered"
-# Let the first rescan finish: it ends by setting the status word itself.
 ask status --wait-open --wait-status 102 --timeout-ms 60000 || echo "note: status word did not reach 102; going on"
 
 expect 0 "result: 1" set-status 4321

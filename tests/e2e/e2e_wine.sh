@@ -1,6 +1,5 @@
 #!/bin/sh
-# The Windows executable installed, started, read, stopped and removed under
-# Wine's own service control manager. Needs WINEPREFIX (the build's prefix).
+# Under Wine's service control manager; needs WINEPREFIX.
 set -u
 SVC=$1
 CLIENT=$2
@@ -13,8 +12,7 @@ has_match() { tr -d '\r' <"$2" | grep -q -- "$1"; }
 sc_state() { w sc query SkyvaneSvc 2>/dev/null | tr -d '\r' | grep -q "STATE *: *[0-9]* *$1"; }
 wait_state() { within 120 sc_state "$1"; }
 
-# A client holds the block from the service's start across its stop; it
-# also keeps the prefix's wineserver (and so the service) up meanwhile.
+# The holder also keeps the prefix's wineserver (and so the service) up.
 start_holder
 w "$SVC" -install >"$WORK/install.txt" 2>&1
 has_line "Skyvane Service installed." "$WORK/install.txt" || fail "install line"
@@ -26,16 +24,14 @@ w sc stop SkyvaneSvc >"$WORK/stop.txt" 2>&1 || fail "sc stop"
 wait_state STOPPED || fail "service did not stop"
 holder_saw_500
 
-# A stop while a client streams gauge refreshes (command 9 aborts on the
-# pipe stop) reaches STOPPED within 5 s.
+# A stop while a client streams gauge refreshes (command 9) takes 5 s at most.
 w sc start SkyvaneSvc >/dev/null 2>&1
 wait_state RUNNING || fail "service did not start for the streaming stop"
 (while :; do w "$CLIENT" send 10920 9 0 1 >/dev/null 2>&1 || sleep 0.1; done) &
 STREAM_PID=$!
 sleep 2
 w sc stop SkyvaneSvc >"$WORK/stop2.txt" 2>&1
-# Counted from the delivered control; each query starts a Wine process, so
-# the bound is checked in whole seconds.
+# Whole seconds: each query starts a Wine process.
 START=$(date +%s)
 wait_state STOPPED || fail "service did not stop while a client streamed"
 ELAPSED=$(($(date +%s) - START))
@@ -46,7 +42,6 @@ wait "$STREAM_PID" 2>/dev/null
 w "$SVC" -install >"$WORK/install2.txt" 2>&1
 has_match "^CreateService failed - .* (0x431)$" "$WORK/install2.txt" || fail "second install"
 
-# -remove stops a running service, then deletes it.
 w sc start SkyvaneSvc >/dev/null 2>&1
 wait_state RUNNING || fail "service did not start again"
 w "$SVC" -remove >"$WORK/remove.txt" 2>&1
