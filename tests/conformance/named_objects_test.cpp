@@ -1,8 +1,5 @@
-// Named kernel objects under "Global\": the pagefile-backed mapping, the
-// mutex and the events that the service shares with the user-interface
-// process. Creating an existing name opens the same object
-// (ERROR_ALREADY_EXISTS). (Other processes' use of them is proven on the host
-// by the emulation's process tests and end to end by the host run.)
+// Named kernel objects under "Global\" that the service shares with the
+// user-interface process; creating an existing name opens the same object.
 #include <gtest/gtest.h>
 
 #include <functional>
@@ -35,8 +32,8 @@ class View {
   void* base_;
 };
 
-// The three kinds of named object, each with its create and open call and a
-// check that two handles reach one object.
+// Each kind's create and open calls, and a check that two handles reach one
+// object.
 struct Kind {
   const char* name;
   std::function<HANDLE(const WCHAR*)> create;

@@ -1,9 +1,5 @@
-// Named pipes in message mode and overlapped I/O on them, as the service's
-// pipe server uses them: overlapped connects, reads that pend and complete
-// through their event, GetOverlappedResult, CancelIo (the calling thread's
-// requests only) and ERROR_MORE_DATA for a message longer than the read. (The
-// instance limit, message boundaries, disconnection and leaving clients are
-// proven by the pipe server's own tests, which also run under Wine.)
+// Message-mode named pipes and overlapped I/O on them, as the service's pipe
+// server uses them (its own tests cover instance limits and disconnection).
 #include <gtest/gtest.h>
 
 #include <string>
@@ -26,17 +22,13 @@ WideString PipeName() {
   return skytest::UniqueName("\\\\.\\pipe\\", "pipe");
 }
 
-// One server instance as the service creates it: duplex, overlapped, message
-// type and read mode.
-Handle CreateServer(const WideString& name, DWORD maxInstances = 16, DWORD extraFlags = 0,
-                    SECURITY_ATTRIBUTES* attributes = nullptr) {
-  return Handle(
-      CreateNamedPipeW(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED | extraFlags,
-                       PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, maxInstances,
-                       kPipeBufferBytes, kPipeBufferBytes, 5000, attributes));
+// One server instance as the service creates it.
+Handle CreateServer(const WideString& name, SECURITY_ATTRIBUTES* attributes = nullptr) {
+  return Handle(CreateNamedPipeW(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
+                                 PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, 16,
+                                 kPipeBufferBytes, kPipeBufferBytes, 5000, attributes));
 }
 
-// A synchronous client end.
 Handle OpenClient(const WideString& name) {
   return Handle(CreateFileW(name.c_str(), GENERIC_READ | GENERIC_WRITE, 0, nullptr, OPEN_EXISTING,
                             0, nullptr));
@@ -61,15 +53,13 @@ DWORD StartRead(HANDLE pipe, Overlapped& read, char* buffer, DWORD capacity) {
   return ReadFile(pipe, buffer, capacity, &bytes, read.Get()) ? 0 : GetLastError();
 }
 
-// Reads one message (or what fits) from the overlapped server end, waiting
-// for it: the read's error (0 on success), the text in `text`.
+// Reads one message (or what fits) from the server end: the read's error.
 DWORD ReadServer(HANDLE server, std::string& text, DWORD capacity = 256) {
   Overlapped read;
   std::vector<char> buffer(capacity);
   DWORD bytes = 0;
   DWORD error = StartRead(server, read, buffer.data(), capacity);
-  // The count of a read that ended with ERROR_MORE_DATA is reported, as for
-  // a pending one, by GetOverlappedResult.
+  // A read that ended with ERROR_MORE_DATA reports its count here too.
   if (error == ERROR_IO_PENDING || error == ERROR_MORE_DATA || error == 0) {
     error = GetOverlappedResult(server, read.Get(), &bytes, TRUE) ? 0 : GetLastError();
   }
@@ -77,8 +67,7 @@ DWORD ReadServer(HANDLE server, std::string& text, DWORD capacity = 256) {
   return error;
 }
 
-// A server instance (overlapped) with its synchronous client connected: the
-// client came first, so the connect gives ERROR_PIPE_CONNECTED.
+// A server instance whose synchronous client came first (ERROR_PIPE_CONNECTED).
 struct Connection {
   Handle server;
   Handle client;
@@ -104,7 +93,7 @@ TEST(Pipe, ConnectPendsUntilAClientOpensAndAnEarlierClientIsAlreadyConnected) {
   ASSERT_TRUE(InitializeSecurityDescriptor(&descriptor, SECURITY_DESCRIPTOR_REVISION));
   ASSERT_TRUE(SetSecurityDescriptorDacl(&descriptor, TRUE, nullptr, FALSE));
   SECURITY_ATTRIBUTES attributes{sizeof(attributes), &descriptor, FALSE};
-  Handle server = CreateServer(name, 16, 0, &attributes);
+  Handle server = CreateServer(name, &attributes);
   ASSERT_TRUE(server);
   Overlapped connect;
   ASSERT_EQ(ConnectOverlapped(server.Get(), connect), ERROR_IO_PENDING);
@@ -164,16 +153,13 @@ TEST(Overlapped, ReadPendsUntilDataAndDataWaitingCompletesAtOnce) {
   EXPECT_EQ(writer.Join(), 0u);
 }
 
-// CancelIo aborts the calling thread's pending read and leaves another
-// thread's read on the same handle pending; the handle stays usable.
 TEST(Overlapped, CancelIoAbortsOnlyTheCallingThreadsRequests) {
   Connection pipe;
   EXPECT_TRUE(CancelIo(pipe.server.Get()));  // nothing pending: still success
   Handle issued = NewEvent(true, false);
   Overlapped other;
   char otherBuffer[64] = {};
-  // The thread stays alive until its request is done (Windows also cancels a
-  // thread's requests when it ends).
+  // The thread stays alive until its request is done.
   Thread thread([&]() -> DWORD {
     DWORD error = StartRead(pipe.server.Get(), other, otherBuffer, sizeof(otherBuffer));
     if (error != ERROR_IO_PENDING) return 0xF000 + error;

@@ -1,8 +1,4 @@
-// The registry as the service's registry command uses it: keys created and
-// opened with KEY_ALL_ACCESS, typed values replaced and deleted, names without
-// case, and error 2 for a missing key or value. (Short buffers and the
-// service's own requests are proven by its registry request tests, which also
-// run under Wine.)
+// The registry as the service's registry command uses it.
 #include <gtest/gtest.h>
 
 #include <cstring>

@@ -1,7 +1,5 @@
 // Events, waits, mutexes, threads and critical sections as the service uses
-// them: auto- and manual-reset events, waits on up to 64 handles (lowest
-// index first, time-outs, failure on a closed handle), recursive mutexes and
-// their abandonment, thread ends and exit codes, per-thread last error.
+// them.
 #include <gtest/gtest.h>
 
 #include <vector>
@@ -15,8 +13,7 @@ using skytest::kGuardMs;
 using skytest::NewEvent;
 using skytest::Thread;
 
-// The result of a wait of zero time on `object` from another thread (which
-// gives back a mutex it got).
+// A zero wait on `object` from another thread (which gives back a mutex it got).
 DWORD TryFromOtherThread(HANDLE object) {
   Thread thread([object]() -> DWORD {
     DWORD result = WaitForSingleObject(object, 0);
@@ -62,8 +59,7 @@ TEST(Waits, AnyOfSixtyFourReportsLowestSignalledIndexAndConsumesOnlyThat) {
   EXPECT_EQ(waitAny(), WAIT_OBJECT_0 + 63);
   EXPECT_EQ(waitAny(), WAIT_TIMEOUT);
 
-  // A set manual-reset event in front (the pipe server's stop event in slot
-  // 0) wins every time over the ones behind it.
+  // A set event in slot 0 (the pipe server's stop event) always wins.
   Handle stop = NewEvent(true, true);
   raw[0] = stop.Get();
   ASSERT_TRUE(SetEvent(raw[5]));
@@ -99,8 +95,6 @@ TEST(Waits, ClosedHandleFailsWithInvalidHandle) {
   }
 }
 
-// A mutex is taken again by its owner and needs as many releases; when the
-// owner thread ends holding it, the next waiter gets it told it was abandoned.
 TEST(Mutex, OwnerTakesItAgainNeedsAsManyReleasesAndAbandonsItByEnding) {
   Handle mutex(CreateMutexW(nullptr, FALSE, nullptr));
   Handle initiallyOwned(CreateMutexW(nullptr, TRUE, nullptr));
@@ -169,9 +163,8 @@ TEST(Threads, HandleIsSignalledWhenTheThreadEndsWithItsExitCodeAndOwnLastError) 
   EXPECT_EQ(seenId, thread.Id());
 }
 
-// Two threads count under a mutex (half of the takes through a wait-all with
-// a set event, as the worker table waits) and under a critical section entered
-// twice: neither count loses an increment.
+// Half of the mutex takes go through a wait-all with a set event, as the
+// worker table waits; the critical section is entered twice.
 TEST(Exclusion, MutexAndCriticalSectionKeepConcurrentCountsExact) {
   constexpr long kIncrements = 20000;
   Handle mutex(CreateMutexW(nullptr, FALSE, nullptr));

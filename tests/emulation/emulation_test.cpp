@@ -1,7 +1,4 @@
-// Properties of the POSIX emulation itself that the conformance suite cannot
-// state: live handle and thread counts (the leak check after every case
-// relies on them), the time scale, objects of dead processes, and device
-// requests completed by a device provider.
+// Properties of the emulation itself that the conformance suite cannot state.
 #include <gtest/gtest.h>
 #include <stdlib.h>
 
@@ -56,8 +53,7 @@ TEST(Handles, HandlesAndThreadsAreCountedAndAClosedHandleIsNeverValid) {
   while (platform::LiveThreadCount() != 0) Sleep(1);  // ends with the thread, or the case times out
 }
 
-// The factor is read once per process, so the check runs in a child started
-// with its own value: hours of emulated waiting pass in about 1.5 s.
+// The factor is read once per process, so a child runs with its own value.
 TEST(TimeScale, HoursOfWaitingPassQuicklyWithATinyScale) {
   if (skytest::ChildRole() != nullptr) {
     EXPECT_DOUBLE_EQ(platform::TimeScale(), 0.0001);
@@ -117,9 +113,8 @@ struct FakeProvider : emu::DeviceProvider {
   }
 };
 
-// A device request completes once, from any thread, into the caller's
-// buffer; closing the handle cancels what is pending. (Which thread's
-// requests CancelIo cancels is shown on the simulated computer.)
+// A device request completes once, from any thread, into the caller's buffer;
+// closing the handle cancels what is pending.
 TEST(DeviceRequests, CompleteOnceIntoTheCallersBufferAndAreCancelledOnClose) {
   FakeProvider provider;
   emu::SetDeviceProvider(&provider);

@@ -1,8 +1,5 @@
-// Named pipes between processes and pipe lifetimes: an end whose process dies
-// at any moment (even inside the kernel lock) counts as closed and the server
-// goes on; a dead server's pipe is gone; closing a server ends its pending
-// connect; a request outlives the event handle its caller closed. The other
-// process is this test program started again.
+// Named pipes between processes (this program started again) and pipe
+// lifetimes.
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -57,10 +54,8 @@ void ServeOneExchange(HANDLE server, OVERLAPPED* ov) {
   EXPECT_TRUE(DisconnectNamedPipe(server));
 }
 
-// A client process killed at any moment leaves the server's process working
-// as on Windows: its pipe end is closed (the pending read breaks), a mutex it
-// owned is abandoned, a change it left half made is undone, and the instance
-// serves the next client.
+// A client killed at any moment (even inside the kernel lock): its pipe end
+// closes, its mutex is abandoned, and the instance serves the next client.
 enum class KillPoint { kInWrite, kInRead, kInWait, kOwningMutex, kInsideKernelLock };
 
 class KilledClient : public ::testing::TestWithParam<KillPoint> {};
@@ -169,9 +164,8 @@ TEST(PipeProcesses, KilledServerBreaksTheClientAndRemovesThePipe) {
   EXPECT_EQ(GetLastError(), ERROR_FILE_NOT_FOUND);
 }
 
-// Closing a server instance ends its pending connect (as the service's stop
-// does), and a request keeps its event object alive after the caller closed
-// the handle; finishing it then drops the last reference inside the emulation.
+// Closing a server instance ends its pending connect; a request keeps its
+// event alive after the caller closed the handle.
 TEST(PipeLifetime, ClosingEndsAPendingConnectAndAPendingReadOutlivesItsEvent) {
   HANDLE server = CreateServer();
   OVERLAPPED ov{};

@@ -1,10 +1,6 @@
-// The emulated registry beyond what the conformance suite states: the checks
-// that outside input (the registry command) can reach, access rights and
-// read-only keys, and the store file: shared by processes without lost
-// writes, damaged files read as empty, any name and data round-tripping.
+// The emulated registry beyond the conformance suite: checks the registry
+// command can reach, access rights, read-only keys and the store file.
 #include <gtest/gtest.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <cstdlib>
 #include <cstring>
@@ -16,6 +12,7 @@
 #include "platform/posix/registry_store.h"
 #include "platform/wide.h"
 #include "platform/win32.h"
+#include "support/child_process.h"
 #include "support/test_support.h"
 
 namespace {
@@ -42,8 +39,7 @@ std::string ReadFile(const std::string& path) {
   return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
 }
 
-// Each case works below a key of its own (and every test process has a
-// registry store of its own).
+// Each case works below a key of its own.
 class Registry : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -137,8 +133,7 @@ TEST_F(Registry, AccessRightsAndReadOnlyKeys) {
             ERROR_FILE_NOT_FOUND);
 }
 
-// Two processes writing at the same time lose nothing: every operation
-// re-reads and rewrites the store under the file lock.
+// Two processes writing at once lose nothing (each call rewrites under a lock).
 TEST_F(Registry, ProcessesShareTheStoreWithoutLostWrites) {
   {
     Key key;
@@ -149,27 +144,22 @@ TEST_F(Registry, ProcessesShareTheStoreWithoutLostWrites) {
   auto name = [](int c, int i) {
     return Utf8ToWide("c" + std::to_string(c) + "-" + std::to_string(i));
   };
-  pid_t children[2];
+  const char* const roles[] = {"writer0", "writer1"};
   for (int c = 0; c < 2; ++c) {
-    pid_t pid = fork();
-    ASSERT_GE(pid, 0);
-    if (pid == 0) {
+    skytest::RunAsChild(roles[c], [&, c] {
       HKEY key = nullptr;
       if (RegOpenKeyExW(HKEY_CURRENT_USER, path.c_str(), 0, KEY_SET_VALUE, &key) != ERROR_SUCCESS)
-        _exit(10);
+        return 10;
       for (int i = 0; i < kPerChild; ++i) {
         if (SetDword(key, name(c, i).c_str(), static_cast<DWORD>(c * 1000 + i)) != ERROR_SUCCESS)
-          _exit(11);
+          return 11;
       }
-      _exit(RegCloseKey(key) == ERROR_SUCCESS ? 0 : 12);
-    }
-    children[c] = pid;
+      return RegCloseKey(key) == ERROR_SUCCESS ? 0 : 12;
+    });
   }
-  for (pid_t pid : children) {
-    int status = 0;
-    ASSERT_EQ(waitpid(pid, &status, 0), pid);
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
-  }
+  skytest::ChildProcess children[2];
+  for (int c = 0; c < 2; ++c) ASSERT_TRUE(children[c].Start(roles[c]));
+  for (auto& child : children) EXPECT_EQ(child.Wait(skytest::kProcessGuardMs), 0);
   Key key;
   ASSERT_EQ(Open(u"Shared", KEY_READ, key), ERROR_SUCCESS);
   for (int c = 0; c < 2; ++c) {
@@ -179,8 +169,7 @@ TEST_F(Registry, ProcessesShareTheStoreWithoutLostWrites) {
   }
 }
 
-// A store file that is damaged in any way reads as an empty registry, and the
-// next write replaces it with a good one.
+// A damaged store reads as empty; the next write replaces it with a good one.
 TEST_F(Registry, DamagedStoreReadsAsEmpty) {
   {
     Key key;

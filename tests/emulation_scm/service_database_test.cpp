@@ -1,9 +1,6 @@
-// The emulated service database: install and remove, kept in the registry
-// where Windows keeps it and so seen by every process, and the executable's
-// path that install records. (The event log's records are asserted by the
-// service's own tests.)
+// The emulated service database, kept in the registry and so seen by every
+// process.
 #include <gtest/gtest.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <climits>
@@ -11,13 +8,14 @@
 
 #include "platform/wide.h"
 #include "platform/win32.h"
+#include "support/child_process.h"
+#include "support/test_support.h"
 
 namespace {
 
 constexpr const WCHAR* kKey = u"SYSTEM\\CurrentControlSet\\Services\\EmuDbSvc";
 
-// A value of the service's key as text ("<no key>" when the key is missing)
-// or, for a DWORD, its number.
+// A value of the service's key as text, "<no key>" when the key is missing.
 std::string Stored(const WCHAR* name) {
   HKEY key = nullptr;
   if (RegOpenKeyExW(HKEY_LOCAL_MACHINE, kKey, 0, KEY_READ, &key) != ERROR_SUCCESS) {
@@ -41,18 +39,12 @@ SC_HANDLE Install(SC_HANDLE manager, const WCHAR* name = u"EmuDbSvc",
                         nullptr, u"\0", nullptr, nullptr);
 }
 
-// Installed by another process, found, described, refused twice, removed as
-// the remove verb does it.
 TEST(ServiceDatabase, InstallQueryAndRemove) {
-  pid_t pid = fork();
-  ASSERT_GE(pid, 0);
-  if (pid == 0) {
+  skytest::RunAsChild("installer", [] {
     SC_HANDLE manager = OpenSCManagerW(nullptr, nullptr, SC_MANAGER_ALL_ACCESS);
-    _exit(manager != nullptr && Install(manager) != nullptr ? 0 : 1);
-  }
-  int exitStatus = 0;
-  ASSERT_EQ(waitpid(pid, &exitStatus, 0), pid);
-  ASSERT_TRUE(WIFEXITED(exitStatus) && WEXITSTATUS(exitStatus) == 0);
+    return manager != nullptr && Install(manager) != nullptr ? 0 : 1;
+  });
+  ASSERT_EQ(skytest::RunChildSelf("installer", skytest::kProcessGuardMs), 0);
 
   EXPECT_EQ(Stored(u"ImagePath"), "2:/opt/emu db/svc");  // REG_EXPAND_SZ
   EXPECT_EQ(Stored(u"DisplayName"), "1:Emu Db Service");

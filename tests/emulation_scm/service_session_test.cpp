@@ -1,10 +1,5 @@
-// The emulated manager session, with a small service of the test's own run
-// by StartServiceCtrlDispatcherW as Windows runs one: handlers on the
-// dispatcher's thread, the main function on its own, refused status reports
-// not kept, ControlService following the service's state, and volume
-// broadcasts kept from services. (The service's own tests run the real service
-// this way: its reports in order, a device event reaching only the
-// registration of its class, a failed registration.)
+// The emulated manager session, running a small service of the test's own
+// through StartServiceCtrlDispatcherW.
 #include <gtest/gtest.h>
 
 #include <condition_variable>
@@ -21,9 +16,8 @@ namespace {
 constexpr GUID kClassA = {
     0x6B1E0C27, 0x5A94, 0x4D3B, {0x9F, 0x10, 0x2C, 0x7E, 0x8A, 0x41, 0xD5, 0xB3}};
 
-// The test's service: reports start-pending until it may run, registers for
-// the device events of one class, reports running accepting no control, and
-// on a stop unregisters and reports stopped.
+// Start-pending until it may run, then registered for one device class and
+// running accepting no control; a stop unregisters and reports stopped.
 struct FakeService {
   std::mutex lock;
   std::condition_variable changed;

@@ -61,9 +61,7 @@ void OpenChannels() {
   }
 }
 
-// What a rescan and the workers' linking build, without worker threads: the
-// drives, their letters, the channel records with the shared handles open,
-// each channel linked, and the published list.
+// What a rescan and the workers' linking build, without worker threads.
 void Scan() {
   CloseChannels();
   std::memset(static_cast<void*>(block), 0, sizeof(StateBlock));
@@ -112,18 +110,15 @@ void SetUpOnce() {
   for (const sim::Machine::DriveSummary& drive : machine->Drives())
     driveNames.push_back(drive.name);
   computer = new fuzzsupport::RecordingComputer(std::move(machine));
-  // No mapping: a publish then copies nothing. The pipe target covers
-  // publishing; here a 1.2 MB copy per input would take most of the time.
+  // No mapping: a 1.2 MB publish per input would take most of the time.
   block = fuzzsupport::SetUpMonitor(false);
   snapshot = static_cast<StateBlock*>(std::calloc(1, sizeof(StateBlock)));
   Check(snapshot != nullptr, "set-up");
   Scan();
 }
 
-// Puts the computer and the block back as the set-up left them. A removed
-// drive comes back with the same paths, and a closed channel handle is opened
-// again; the records of the set-up still describe the computer, so they are
-// restored rather than rebuilt.
+// Puts the computer and the block back as the set-up left them; the set-up's
+// records still describe the computer, so they are restored, not rebuilt.
 void Restore() {
   bool reopen = false;
   for (const std::string& name : driveNames) {
@@ -157,8 +152,7 @@ int DriveFuzzOneInput(const std::uint8_t* data, std::size_t size) {
   if (size == 0) return 0;
   const std::uint8_t selector = data[0];
   const std::size_t received = std::min<std::size_t>(size - 1, kPipeReadSize);
-  // The message as it arrives, in a buffer of exactly its size: the selected
-  // command, and the key of one of the service's drives when asked for.
+  // In a buffer of exactly its size, with the selected command and drive key.
   std::unique_ptr<BYTE[]> message(new BYTE[received == 0 ? 1 : received]);
   std::memcpy(message.get(), data + 1, received);
   const std::uint32_t command = kDriveCommands[(selector & 7) % std::size(kDriveCommands)];

@@ -39,15 +39,13 @@ void CheckCodes(std::uint32_t command, std::uint32_t result, std::uint32_t detai
     case kCommandSafeRemove:
       if (paused) {
         Check(result == 0 && detail == 1, "command 1 while paused");
-      } else {
-        Check(result == 0 || (result == 1 && detail == 0), "command 1 codes");
-        Check(!noDrives || result == 0, "command 1 removed a drive that is not there");
+        break;
       }
-      break;
+      [[fallthrough]];
     case kCommandReleaseDrive:
     case kCommandReleaseDriveAlso:
-      Check(result == 0 || (result == 1 && detail == 0), "command 2 codes");
-      Check(!noDrives || result == 0, "command 2 released a drive that is not there");
+      Check(result == 0 || (result == 1 && detail == 0), "commands 1 to 3 codes");
+      Check(!noDrives || result == 0, "commands 1 to 3 acted on a drive that is not there");
       break;
     case kCommandForwardMessage:
     case kCommandPause:
@@ -158,8 +156,7 @@ void CheckReply(const std::uint8_t* original, std::size_t received, const std::u
 
   const auto command =
       static_cast<std::uint32_t>(ReadAt(original, received, offsetof(CommandMessage, command), 4));
-  // What the command may write: result and detail always; the status block
-  // for command 11; a query's length, type and data area for command 13.
+  // Result and detail; the status block for 11; a query's reply for 13.
   const std::size_t status = offsetof(CommandMessage, statusBlock);
   const std::size_t registry = kRegistryRequestOffset;
   const bool query = command == kCommandRegistry &&
@@ -177,8 +174,7 @@ void CheckReply(const std::uint8_t* original, std::size_t received, const std::u
     dataBegin = registry + kRegistryPathOffset + nameOffset + dataOffset;
     dataEnd = dataBegin + dataLength;
   }
-  // The reply as it must be: what arrived, zero beyond it, with the reply's
-  // own bytes copied in where the command may write.
+  // What arrived, zero beyond it, the reply's bytes where the command writes.
   static std::uint8_t expected[kCommandMaxLength];
   std::memset(expected, 0, length);
   std::memcpy(expected, original, std::min(received, length));

@@ -1,12 +1,6 @@
 #!/usr/bin/env python3
-"""Writes the seed corpora of the command channel's fuzz targets.
-
-corpus/: each seed is one selector byte (even: a pipe message for the
-dispatcher; odd: a registry request alone) followed by the input.
-corpus_drives/: each seed is one selector byte (low three bits: command 1, 2,
-3, 9, 11, 12; 0x08: paused; high four bits: the drive whose key the image
-carries) followed by the message.
-"""
+"""Writes the seed corpora of the command channel's fuzz targets: one
+selector byte (see fuzz_support.h), then the input."""
 import os
 import struct
 

@@ -14,8 +14,7 @@ using fuzzsupport::Check;
 
 fuzzsupport::RecordingComputer* computer = nullptr;
 
-// The surroundings the monitor gives the dispatcher, made once, on a computer
-// without drives: nothing a request names may ever be opened.
+// On a computer without drives: nothing a request names may ever be opened.
 void SetUpOnce() {
   static bool done = false;
   if (done) return;
@@ -26,9 +25,8 @@ void SetUpOnce() {
 }
 
 void FuzzDispatcher(const std::uint8_t* data, std::size_t size) {
-  // The instance's buffers, of exactly their size. A read delivers at most
-  // kPipeReadSize bytes; longer messages never reach the dispatcher. The
-  // buffer beyond them holds an earlier request, as on a reused instance.
+  // A read delivers at most kPipeReadSize bytes; the rest of the buffer holds
+  // an earlier request, as on a reused instance.
   static std::unique_ptr<BYTE[]> request(new BYTE[kPipeBufferBytes]);
   static std::unique_ptr<BYTE[]> reply(new BYTE[kPipeBufferBytes]);
   const std::size_t received = size < kPipeReadSize ? size : kPipeReadSize;
@@ -40,8 +38,7 @@ void FuzzDispatcher(const std::uint8_t* data, std::size_t size) {
 }
 
 void FuzzRegistry(const std::uint8_t* data, std::size_t size) {
-  // Exactly `size` bytes, so that a read one byte beyond them is caught by
-  // the address sanitizer.
+  // Exactly `size` bytes, so the address sanitizer catches a read beyond.
   std::unique_ptr<BYTE[]> request(new BYTE[size == 0 ? 1 : size]);
   if (size != 0) std::memcpy(request.get(), data, size);
   const DWORD result = RunRegistryRequest(request.get(), size);

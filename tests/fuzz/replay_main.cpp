@@ -1,6 +1,4 @@
-// Runs every file of the given corpus folders (or single files) once through
-// the fuzzing entry named by FUZZ_ENTRY, so that any compiler's build checks
-// the corpus.
+// Runs every corpus file given (or in the folders given) through FUZZ_ENTRY.
 #include <cstdio>
 #include <filesystem>
 #include <fstream>

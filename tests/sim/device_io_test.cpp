@@ -1,8 +1,5 @@
-// What the simulated devices do that the service's own tests only ever meet
-// as outcomes: a device that vanishes completes its pending requests and
-// fails later ones with the error it was given, injected faults come and go
-// as told, and SetupAPI and the configuration manager refuse misuse as
-// Windows does.
+// What the simulated devices do that the service's own tests only meet as
+// outcomes: removal, injected faults, and refused device-list misuse.
 #include <gtest/gtest.h>
 
 #include <cstring>
@@ -21,15 +18,13 @@ constexpr DWORD kWaitEvent = 0x223C04;  // the button filter driver's event wait
 
 class DeviceIo : public DefaultMachineTest {};
 
-// A driver-channel wait and a HID read pend; the drive vanishes with the
-// error given; the pending request and every later one fail with it. A list
-// taken before the removal keeps the ID but not the node.
+// A vanished drive fails its pending and later requests with the given error;
+// a list taken before the removal keeps the ID but not the node.
 TEST_F(DeviceIo, VanishingDeviceCompletesPendingAndLaterRequestsWithItsError) {
   HDEVINFO list = SetupDiGetClassDevsW(&sim::kVendorClassA, nullptr, nullptr,
                                        DIGCF_PRESENT | DIGCF_DEVICEINTERFACE);
   ASSERT_NE(list, INVALID_HANDLE_VALUE);
-  SP_DEVICE_INTERFACE_DATA data{};
-  data.cbSize = sizeof data;
+  SP_DEVICE_INTERFACE_DATA data{sizeof data, {}, 0, 0};
   ASSERT_TRUE(SetupDiEnumDeviceInterfaces(list, nullptr, &sim::kVendorClassA, 0, &data));
   GUID hid{};
   HidD_GetHidGuid(&hid);
@@ -68,8 +63,7 @@ TEST_F(DeviceIo, VanishingDeviceCompletesPendingAndLaterRequestsWithItsError) {
     EXPECT_TRUE(CloseHandle(device));
   }
   DWORD needed = 0;
-  SP_DEVINFO_DATA info{};
-  info.cbSize = sizeof info;
+  SP_DEVINFO_DATA info{sizeof info, {}, 0, 0};
   EXPECT_FALSE(SetupDiGetDeviceInterfaceDetailW(list, &data, nullptr, 0, &needed, &info));
   EXPECT_EQ(GetLastError(), ERROR_INSUFFICIENT_BUFFER);
   WCHAR id[256] = {};
@@ -105,10 +99,8 @@ TEST_F(DeviceIo, VanishingDeviceCompletesPendingAndLaterRequestsWithItsError) {
   EXPECT_EQ(seen, "-+");
 }
 
-// Opens fail as many times as told; I/O fails as many times as told, for the
-// one operation named only; a hung request is cancelled by its own thread's
-// CancelIo only (another thread's ends when the handle closes), and a slow
-// cancel still writes the reply into the caller's buffers.
+// Faults fail as many times as told; CancelIo cancels only its own thread's
+// hung request, and a slow cancel still writes the reply.
 TEST_F(DeviceIo, InjectedFaultsComeAndGoAsTold) {
   InitializeProcessLocks();  // the service's transfers take the pass-through lock
   const std::string disk = PathWith(GUID_DEVINTERFACE_DISK, "374b3241");
@@ -187,8 +179,7 @@ TEST_F(DeviceIo, SetupApiAndConfigurationManagerRefuseMisuseAsWindowsDoes) {
   detail->cbSize = 8;
   EXPECT_FALSE(SetupDiGetDeviceInterfaceDetailW(list, &data, detail, needed - 2, nullptr, nullptr));
   EXPECT_EQ(GetLastError(), ERROR_INSUFFICIENT_BUFFER);
-  SP_DEVINFO_DATA info{};
-  info.cbSize = sizeof info;
+  SP_DEVINFO_DATA info{sizeof info, {}, 0, 0};
   ASSERT_TRUE(SetupDiGetDeviceInterfaceDetailW(list, &data, detail, needed, nullptr, &info));
   // An instance ID buffer one unit short.
   DWORD idLength = 0;

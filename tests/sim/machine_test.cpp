@@ -1,6 +1,4 @@
-// The machine as a whole: description texts (their errors, and a drive that
-// answers as written), the machine the environment names, and device events
-// one at a time.
+// Description texts, the machine the environment names, and device events.
 #include <gtest/gtest.h>
 
 #include <chrono>

@@ -1,6 +1,4 @@
-// Helpers of the simulation tests: a default machine installed for one case
-// (its device events recorded), device lists read through SetupAPI, and
-// pass-through requests as the service builds them.
+// Helpers of the simulation tests.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -57,8 +55,7 @@ struct Found {
   std::string instanceId;
 };
 
-// Every interface of a class, read as the service reads it (size query,
-// then the detail and the device's instance ID).
+// Every interface of a class, read as the service reads it.
 inline std::vector<Found> ListInterfaces(const GUID& interfaceClass) {
   std::vector<Found> found;
   HDEVINFO list = SetupDiGetClassDevsW(&interfaceClass, nullptr, nullptr,
@@ -98,8 +95,7 @@ inline std::string PathWith(const GUID& interfaceClass, const std::string& part 
   return {};
 }
 
-// A machine built from the embedded default description, installed for the
-// test case; device events go to a list instead of the service manager.
+// The default machine, installed for the case; its device events are recorded.
 class DefaultMachineTest : public ::testing::Test {
  protected:
   void SetUp() override {

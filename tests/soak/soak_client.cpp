@@ -1,7 +1,5 @@
-// The client side of the soak: `stream` exchanges set-status requests on one
-// connection until it is killed (opening again when the exchange fails);
-// `probe LIMIT_MS` opens the pipe, exchanges one request and fails (exit 3)
-// when that took longer than LIMIT_MS, printing the time either way.
+// Soak client: `stream` exchanges set-status requests until killed; `probe
+// LIMIT_MS` exchanges one and exits 3 when it took longer than LIMIT_MS.
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
@@ -13,8 +11,7 @@
 
 namespace {
 
-// The status value the soak keeps: the service's own "ready" value, so the
-// block stays sane while the soak runs.
+// The service's own "ready" value, so the block stays sane.
 constexpr DWORD kReady = 102;
 
 bool ExchangeOnce(HANDLE pipe) {

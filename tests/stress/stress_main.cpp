@@ -1,13 +1,6 @@
-// Stop/start cycles of the whole service on the embedded default machine,
-// under faults and load: devices that hang, that are slow or never finish a
-// cancel, that vanish in the middle of I/O; storms of presses; attach and
-// detach loops; pipe clients streaming commands. Each cycle checks that the
-// stop ends within its limit, that no handle or thread of the emulation is
-// left over, and that the last block the service left is sane.
-//
-//   stress [--cycles N] [--run-ms MS] [--stop-limit-ms MS] [--no-held-cancels] [--seed S]
-//
-// Prints one summary line; the exit code is 0 when every cycle passed.
+// Stop/start cycles of the whole service on the default machine under device
+// faults, presses, attach/detach loops and pipe clients. Each stop must end in
+// its limit, leave no handle or thread, and leave a sane block.
 #include <unistd.h>
 
 #include <algorithm>
@@ -52,7 +45,6 @@ struct Totals {
   long maxStopMs = 0;
 };
 
-// A value below `n`.
 DWORD Pick(std::mt19937& random, DWORD n) {
   return static_cast<DWORD>(random() % n);
 }
@@ -83,10 +75,9 @@ void PipeClient(unsigned seed, HANDLE mapping) {
     for (int n = 0; n < 20 && chaosRunning; ++n) {
       switch (Pick(random, 10)) {
         case 0:
-          InitCommand(request.get(), kCommandSafeRemove, Pick(random, 4));
-          break;
         case 1:
-          InitCommand(request.get(), kCommandReleaseDrive, Pick(random, 4));
+          InitCommand(request.get(), Pick(random, 2) ? kCommandSafeRemove : kCommandReleaseDrive,
+                      Pick(random, 4));
           break;
         case 2:
           InitCommand(request.get(), kCommandForwardMessage, 0x218, Pick(random, 2) ? 4 : 7);
@@ -233,8 +224,7 @@ void RunCycle(const Options& options, sim::Machine* machine, HANDLE mapping, std
   while (!monitorDone) {
     const auto waited = Clock::now() - stopAt;
     if (!released && waited > std::chrono::milliseconds(options.stopLimitMs)) {
-      // Over the limit: let held cancels finish and see whether that ends it
-      // (the pipe clients may wait for a reply until then).
+      // Over the limit: see whether releasing held cancels ends it.
       chaosRunning = false;
       devices.join();
       machine->ClearFaults();
@@ -266,16 +256,14 @@ void RunCycle(const Options& options, sim::Machine* machine, HANDLE mapping, std
     failed = true;
     std::fprintf(stderr, "cycle %d: last block: %s\n", totals->cycles, why.c_str());
   }
-  // Back to a whole machine for the next cycle.
   machine->ClearFaults();
   machine->FinishHeldCancels();
   for (const char* drive : kDrives) {
     if (!machine->Attached(drive)) machine->Attach(drive);
   }
   machine->WaitForDeviceEvents();
-  // Requests set aside after their cancel grace completed only now that the
-  // cancels were released; the service frees such blocks when it next sees
-  // them, as the run that set them aside has ended, so does the harness.
+  // Requests set aside after their cancel grace completed only now; the
+  // service would free them on its next run, so the harness does.
   FreeSetAsideIoBlocks();
   if (!CountsSettle(handles, threads)) {
     failed = true;
@@ -318,8 +306,7 @@ int main(int argc, char** argv) {
                  "[--no-held-cancels] [--seed S]\n");
     return 2;
   }
-  // A namespace of its own: a run that is killed must not leave shared state
-  // behind for other programs.
+  // A namespace of its own, so a killed run leaves nothing shared behind.
   if (std::getenv("SKYVANE_NAMESPACE") == nullptr) {
     const std::string name = "stress-" + std::to_string(static_cast<long>(getpid()));
     setenv("SKYVANE_NAMESPACE", name.c_str(), 1);

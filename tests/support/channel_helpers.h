@@ -1,6 +1,4 @@
-// Helpers for tests that drive channel records of a state block directly:
-// opening a channel's shared handle as the worker starter does, and finding a
-// channel by a part of its device path.
+// Helpers for tests that drive channel records of a state block directly.
 #pragma once
 
 #include <gtest/gtest.h>

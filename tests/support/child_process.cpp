@@ -26,10 +26,6 @@ const char* ChildRole() {
 #if !defined(_WIN32)
 namespace {
 
-std::string FilterArgument() {
-  return "--gtest_filter=" + CurrentTestName();
-}
-
 bool IsOwnVariable(const std::string& entry) {
   for (const char* name : {kChildRoleVariable, kOwnerPidVariable}) {
     std::string prefix = std::string(name) + "=";
@@ -42,7 +38,7 @@ bool IsOwnVariable(const std::string& entry) {
 
 bool ChildProcess::Start(const char* role) {
   if (Running()) return false;
-  std::string filter = FilterArgument();
+  std::string filter = "--gtest_filter=" + CurrentTestName();
   std::string self = "/proc/self/exe";
   std::vector<char*> argv = {self.data(), filter.data(), nullptr};
 

@@ -1,16 +1,6 @@
-// Cross-process cases: the test program starts ITSELF again, filtered to the
-// running case, with a role in the environment, so one case body holds both
-// sides. The child inherits the whole environment, including the emulation's
-// namespace and registry store, so it shares the parent's named objects.
-//
-//   TEST(Shared, Mapping) {
-//     if (skytest::ChildRole() != nullptr) { ...child side...; return; }
-//     ...parent side...;
-//     EXPECT_EQ(skytest::RunChildSelf("reader", skytest::kProcessGuardMs), 0);
-//   }
-//
-// The child's exit code is 0 only when exactly that one case ran and passed.
-// Host only: the Windows build declares these but never starts a child.
+// Cross-process cases: the test program starts itself again, filtered to the
+// running case, with a role in the environment (and the parent's emulation
+// namespace), so one case body holds both sides. Host only.
 #pragma once
 
 #include <cstdint>
@@ -35,11 +25,9 @@ class ChildProcess {
   ChildProcess& operator=(const ChildProcess&) = delete;
   ~ChildProcess();
 
-  // Starts this program again for the running case with `role`; false if the
-  // process could not be started.
+  // Starts this program again for the running case with `role`.
   bool Start(const char* role);
-  // Waits up to `timeoutMs` (real time) for the child to end and returns its
-  // exit code; on time-out the child is killed and -1 is returned.
+  // The child's exit code; on time-out (real time) it is killed and -1 returned.
   int Wait(DWORD timeoutMs);
   // Ends the child at once; Wait then gives 128 + 9 on POSIX.
   void Kill();
@@ -52,9 +40,8 @@ class ChildProcess {
 // Start + Wait: the child's exit code, -1 on time-out, -2 if it did not start.
 int RunChildSelf(const char* role, DWORD timeoutMs);
 
-// At the top of a case: in the child of `role`, runs `body` and ends the
-// process with its result, without gtest's checks (a child may end holding
-// handles on purpose, or be killed).
+// In the child of `role`, runs `body` and exits with its result, skipping
+// gtest's leak checks (a child may end holding handles on purpose).
 template <class Body>
 void RunAsChild(const char* role, Body body) {
   const char* current = ChildRole();

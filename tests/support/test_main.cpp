@@ -1,8 +1,6 @@
-// The main() of every test program. On the host it first gives the process an
-// emulation namespace and registry store of its own (unless the environment
-// already names them, as for a child started by RunChildSelf), so parallel
-// test programs never see each other's named objects, pipes or registry; it
-// removes the registry at exit (the namespace ends with its last process).
+// The main() of every test program. On the host each process gets an emulation
+// namespace and registry store of its own (a child inherits its parent's), so
+// parallel test programs never see each other's objects.
 #include <gtest/gtest.h>
 
 #include <chrono>
@@ -22,9 +20,8 @@
 
 namespace {
 
-// After every case the emulation must hold no live handle or thread of this
-// process. A thread signals its handle before it has quite unwound, so the
-// counts are polled (real time) for a while; a real leak never reaches zero.
+// After every case no handle or thread of this process may be live. A thread
+// signals before it has quite unwound, so the counts are polled for a while.
 class LeakCheck : public ::testing::EmptyTestEventListener {
  public:
   void OnTestEnd(const ::testing::TestInfo& /*info*/) override {

@@ -1,6 +1,4 @@
-// Small helpers shared by the test programs of both platforms: a handle that
-// closes itself, Wine detection for marking known Wine gaps, and object names
-// that are unique per test process and case.
+// Helpers shared by the test programs of both platforms.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -14,9 +12,8 @@
 
 namespace skytest {
 
-// Failure guard for Win32 waits in tests: about ten real seconds, so a hang
-// ends the case instead of the run (divided by SKYVANE_TIME_SCALE, which the
-// emulation applies to every wait).
+// Failure guard for waits: about ten real seconds (divided by
+// SKYVANE_TIME_SCALE, which the emulation applies to every wait).
 DWORD ScaledGuardMs();
 inline const DWORD kGuardMs = ScaledGuardMs();
 // Failure guard for waiting on a child process (real time, never scaled).
@@ -111,9 +108,8 @@ bool IsWine();
 // started by RunChildSelf, so that parent and child agree on the names.
 DWORD OwnerProcessId();
 
-// "<prefix>SkyvaneTest-<owner pid>-<Suite>.<Case>-<tag>": unique per test
-// process and case (Wine shares named objects across the whole prefix), and
-// the same in a child.
+// "<prefix>SkyvaneTest-<owner pid>-<Suite>.<Case>-<tag>": unique per process
+// and case (Wine shares named objects across the prefix), the same in a child.
 WideString UniqueName(const char* prefix, const char* tag);
 // The same without the prefix, as narrow text (for registry key paths).
 std::string UniqueStem(const char* tag);

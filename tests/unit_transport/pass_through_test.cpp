@@ -1,5 +1,4 @@
-// The pass-through transport's failures and aborts; its replies and request
-// blocks are pinned by the enumeration's and the status pages' tests.
+// The pass-through transport's failures and aborts.
 #include "transport/pass_through.h"
 
 #include <gtest/gtest.h>
@@ -39,14 +38,7 @@ class PassThroughTest : public ::testing::Test {
     ownEvent_.Reset(CreateEventW(nullptr, FALSE, FALSE, nullptr));
   }
 
-  void TearDown() override {
-    disk_.Reset();
-    abort_.Reset();
-    ownEvent_.Reset();
-    machine_.Uninstall();
-  }
-
-  sim::Machine machine_;
+  sim::Machine machine_;  // uninstalled after the handles below are closed
   skytest::Handle disk_;
   skytest::Handle abort_;
   skytest::Handle ownEvent_;
@@ -65,9 +57,8 @@ TEST_F(PassThroughTest, RejectedCommandsFailAndShortRepliesAreZeroFilled) {
   for (std::size_t i = 10; i < sizeof(page); ++i) EXPECT_EQ(page[i], 0) << i;
 }
 
-// Runs `operation` on its own thread while the disk holds every request
-// pending, checks what the pass-through lock looks like meanwhile, then
-// signals the abort event and returns the operation's result and last error.
+// Runs `operation` while the disk holds every request pending, checks the
+// pass-through lock meanwhile, then signals the abort event.
 struct AbortOutcome {
   DWORD result = 0;
   DWORD lastError = 0;
@@ -83,7 +74,6 @@ AbortOutcome AbortWhilePending(sim::Machine& machine, HANDLE abortEvent, bool ex
     outcome.lastError = GetLastError();
   });
   EXPECT_TRUE(machine.WaitForPending(kDrive, sim::Endpoint::Disk, 1, skytest::kGuardMs));
-  // The request is pending now, inside the operation.
   const bool entered = TryEnterCriticalSection(&passThroughLock) != FALSE;
   if (entered) LeaveCriticalSection(&passThroughLock);
   EXPECT_EQ(entered, !expectLockHeld);
@@ -126,9 +116,8 @@ TEST_F(PassThroughTest, AbortEndsAPendingTransfer) {
 }
 
 TEST_F(PassThroughTest, ACancelThatNeverEndsHoldsTheCallerOnlyForTheGrace) {
-  // The drive never completes a cancelled request until told: each call
-  // returns after the grace, its request set aside, and the late reply goes
-  // into the set-aside block, never into the caller's buffers.
+  // A cancel the drive never completes: each call returns after the grace, and
+  // the late reply goes into the set-aside block, never the caller's buffers.
   machine_.SetCancelDelay(kDrive, sim::Endpoint::Disk, INFINITE);
   machine_.HangIo(kDrive, sim::Endpoint::Disk, true);
   SetEvent(abort_.Get());
