@@ -230,16 +230,26 @@ end
       machine_->SetCancelDelay("lights", sim::Endpoint::Driver, INFINITE);
       StateLock lock;
       StateBlock* block = monitorState.stateBlock;
+      ChannelRecord* gone = nullptr;
       for (int i = 0; i < block->channelCount; ++i) {
         ChannelRecord& channel = block->channels[i];
         if (WideContains(channel.devicePath, WSTR("external_lights")) &&
             channel.mode == kChannelModeGauge) {
           EXPECT_EQ(SendDriveGone(&channel), 1u);
+          gone = &channel;
           step = 1;
         }
       }
       EXPECT_EQ(step, 1) << "no gauge-mode driver channel";
-      return step != 1;
+      if (gone == nullptr) return true;
+      // The worker gives its read up after the grace, but closes only under
+      // the mutex, which this script still holds.
+      const auto until = std::chrono::steady_clock::now() + std::chrono::milliseconds(200);
+      while (gone->deviceHandle != nullptr && std::chrono::steady_clock::now() < until) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+      }
+      EXPECT_NE(gone->deviceHandle, nullptr) << "closed without the state mutex";
+      return false;
     }
     if (passes.back().endedWorkers == 0) return false;
     machine_->FinishHeldCancels();
