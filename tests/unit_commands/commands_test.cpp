@@ -420,6 +420,13 @@ TEST_F(ButtonEventTest, AWaitEndsOnAStopOrWithTheErrorOfAVanishedDevice) {
   EXPECT_EQ(ReadButtonEvent(Enclosure()), 0x01);
   EXPECT_EQ(GetLastError(), 0u);
   EXPECT_EQ(ReadButtonEvent(Enclosure()), 0x00);
+  // With no workers there is no stop event; a pending wait still takes a press.
+  const HANDLE workerStop = monitorState.workerStopEvent;
+  monitorState.workerStopEvent = nullptr;
+  const EventResult pressed = WaitThen(FireWire(), "firewire", sim::Endpoint::Driver,
+                                       [&] { machine_.Press("firewire", 0x06); });
+  monitorState.workerStopEvent = workerStop;
+  EXPECT_EQ(pressed.event, 0x06);
 
   const EventResult gone = WaitThen(FireWire(), "firewire", sim::Endpoint::Driver,
                                     [&] { machine_.Detach("firewire", ERROR_DEV_NOT_EXIST); });

@@ -381,7 +381,9 @@ using Windows2000RemovalTest = SafeRemovalTest;
 TEST_F(Windows2000RemovalTest, ListedModelIsEjectedThroughItsParent) {
   monitorState.osKind = kOsWindows2000;
   ChannelRecord* plain = Plain();  // model 2A31
+  const ULONGLONG start = GetTickCount64();
   ASSERT_EQ(Remove(plain), 1);
+  EXPECT_GE(GetTickCount64() - start, kEjectNoticePauseMs) << "the drive's pause after the notice";
   EXPECT_EQ(HidValues("plain").at(0), (Bytes{0x20, 0x00})) << "eject notice first";
   const auto ejects = machine_.Ejects();
   ASSERT_EQ(ejects.size(), 1u);
