@@ -185,11 +185,14 @@ bool ParseDriveKey(const std::string& key, const std::string& value, Block* bloc
       return true;
     }
   }
-  if (key == "peripheral" || key == "additional-length" || key == "sleep-state") {
+  if (key == "peripheral" || key == "additional-length" || key == "sleep-state" ||
+      key == "vendor-code-slot") {
     if (!ParseNumber(value, &n) || n > 0xFF) return false;
-    (key == "peripheral"    ? s.peripheral
-     : key == "sleep-state" ? s.sleepState
-                            : s.additionalLength) = static_cast<std::uint8_t>(n);
+    if (key == "vendor-code-slot" && n > 3) return false;
+    (key == "peripheral"         ? s.peripheral
+     : key == "sleep-state"      ? s.sleepState
+     : key == "vendor-code-slot" ? s.vendorCodeSlot
+                                 : s.additionalLength) = static_cast<std::uint8_t>(n);
     return true;
   }
   if (key == "last-lba" || key == "block-length" || key == "bus-address" ||
@@ -270,6 +273,7 @@ drive gauge
   serial QX-7K2A9F31
   model-text QX Vantage 500
   vendor-code QXV7B44
+  vendor-code-slot 0
   status 42 10 20 30
   volume E fixed 500G 312G
 end

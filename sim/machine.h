@@ -72,6 +72,7 @@ struct DriveSpec {
   std::string unitSerial;              // page 0x80; empty: the serial text without "QX-"
   bool rcsIdentity = true;             // page 0xC0 bytes 16-18 "RCS"
   std::string vendorCode = "QXD0001";  // page 0xC1, descriptor tagged 0x80
+  std::uint8_t vendorCodeSlot = 1;     // which of the page's four descriptors it is
 
   // READ CAPACITY(10).
   std::uint32_t lastLba = 976773167;

@@ -2,6 +2,7 @@
 // data, READ CAPACITY(10) and the vendor diagnostic pages 0x80 to 0x83.
 #include <algorithm>
 #include <cstring>
+#include <utility>
 
 #include "machine_state.h"
 
@@ -64,8 +65,10 @@ bool VpdPage(const DriveSpec& spec, std::uint8_t page, std::vector<std::uint8_t>
       break;
     case 0xC1: {
       // Four 8-byte descriptors: a tag byte and seven characters each.
-      const std::uint8_t tags[4] = {0x01, 0x80, 0x81, 0x00};
-      const std::string texts[4] = {"BOOT001", spec.vendorCode, "PANEL01", ""};
+      std::uint8_t tags[4] = {0x01, 0x80, 0x81, 0x00};
+      std::string texts[4] = {"BOOT001", spec.vendorCode, "PANEL01", ""};
+      std::swap(tags[1], tags[spec.vendorCodeSlot & 3]);
+      std::swap(texts[1], texts[spec.vendorCodeSlot & 3]);
       for (int d = 0; d < 4; ++d) {
         data.push_back(tags[d]);
         for (std::size_t i = 0; i < 7; ++i) {
