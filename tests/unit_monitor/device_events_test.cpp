@@ -99,6 +99,7 @@ TEST_F(DeviceEvents, FlagsAreSetUnderTheStateMutex) {
         << type;
   }
   EXPECT_EQ(Current(), (Requests{0, 1, 1, 1}));
+  EXPECT_TRUE(lockprobe::WaitsForTheStateMutex([] { RequestRefresh(); })) << "a refresh request";
 }
 
 }  // namespace
