@@ -74,6 +74,19 @@ TEST_F(WorkersTest, DefaultMachineLinksEveryChannelAndStaysSettled) {
   EXPECT_TRUE(Controls("firewire", CTL_EVENT_REPLY).empty());
 }
 
+// A wait that fails at once on a device that is still there is tried again
+// only after a pause: the worker must not spin.
+TEST_F(WorkersTest, AWaitThatFailsAtOnceIsRetriedAfterAPause) {
+  Install(CountedMachine());
+  machine_->FailIo("firewire", sim::Endpoint::Driver, ERROR_INVALID_FUNCTION, -1, CTL_WAIT_EVENT);
+  const ULONGLONG start = GetTickCount64();
+  Run([&](const std::vector<Pass>& passes) { return passes.size() >= 5; });
+  const ULONGLONG elapsed = GetTickCount64() - start;
+  const std::size_t waits = Controls("firewire", CTL_WAIT_EVENT).size();
+  EXPECT_GE(waits, 2u);
+  EXPECT_LE(waits, elapsed / 100 + 2) << "in " << elapsed << " ms";
+}
+
 TEST_F(WorkersTest, DrivesThatStayIncompleteAskForOneRescanAtMost) {
   // bare: a gauge drive without letters; loose: no path a status pass can open.
   std::string text(sim::DefaultMachineText());
