@@ -1,5 +1,6 @@
 #!/bin/sh
-# e2e_pipe.sh host|wine SERVICE CLIENT: the command channel end to end.
+# e2e_pipe.sh host|wine SERVICE CLIENT: the command channel end to end; on the
+# host also the live block, and the last one a client holds after the stop.
 set -u
 SVC=$2
 CLIENT=$3
@@ -36,7 +37,16 @@ answers() {
 
 start_service
 within 600 answers || fail "the service's pipe never answered"
-ask status --wait-open --wait-status 102 --timeout-ms 60000 || echo "note: status word did not reach 102; going on"
+if [ -z "$RUN" ]; then
+  live_block
+  [ "$(field driveCount "$WORK/live.json")" -ge 4 ] || fail "driveCount"
+  [ "$(field channelCount "$WORK/live.json")" = 4 ] || fail "channelCount"
+  # A client that keeps the mapping open sees the last block after the stop.
+  start_holder
+  holder_holds
+else
+  ask status --wait-open --wait-status 102 --timeout-ms 60000 || echo "note: status word did not reach 102; going on"
+fi
 
 expect 0 "result: 1" set-status 4321
 expect 0 "4321" status --wait-status 4321 --timeout-ms 10000
@@ -54,6 +64,9 @@ expect 0 "4321" status # the short request changed nothing
 running "$SVC_PID" || fail "the service ended during the test"
 if [ -z "$RUN" ]; then
   stop_service
+  grep -q "^Debugging Skyvane Service\.$" "$WORK/service.txt" || fail "no debugging line"
+  grep -q "^Stopping Skyvane Service\.$" "$WORK/service.txt" || fail "no stopping line"
+  holder_saw_500
 else
   kill -INT "$SVC_PID"
   within 50 eval '! running $SVC_PID'

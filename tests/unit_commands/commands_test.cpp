@@ -1,6 +1,4 @@
-// The drive command transport against simulated drives: what each kind of
-// channel puts on the wire, the status and control pages over both paths,
-// the button-event wait and the identity query.
+// The drive command transport against simulated drives.
 #include <algorithm>
 #include <chrono>
 #include <future>
@@ -232,9 +230,8 @@ TEST_F(StatusPagesTest, StatusNibbleMapsToTheStatusCode) {
   }
 }
 
-// The diagnostic path, and the request blocks it and the enumeration hand
-// to the port driver: the data right behind the request in the request's
-// own block (never the caller's buffer), sense space zeroed.
+// Request blocks go to the port driver with the data right behind the request
+// in the block's own memory (never the caller's buffer), sense space zeroed.
 TEST_F(StatusPagesTest, DiagnosticPathHandsThePortDriverTheBlocksItExpects) {
   const DriveRecord drive = DiagnosticDrive();
   SetStatus(machine_, "enclosure", {0x76, 0x01, 0x02, 0x03});
@@ -286,9 +283,7 @@ TEST_F(StatusPagesTest, DiagnosticPathHandsThePortDriverTheBlocksItExpects) {
   EXPECT_EQ(monitorState.refreshRequests, 0u) << "the drive opened: no rescan is asked for";
 }
 
-// A USB drive whose HID collection never answers: every read and write is
-// given up on the caller's stop event instead of holding it (and the mutex
-// it holds) for good.
+// Every transfer with a HID collection that never answers ends on the stop.
 TEST_F(StatusPagesTest, HungHidCollectionIsGivenUpOnTheStopEvent) {
   const DriveRecord drive = HidDrive();
   machine_.HangIo("gauge", sim::Endpoint::Hid, true);
@@ -447,11 +442,9 @@ TEST_F(ButtonEventTest, AWaitEndsOnAStopOrWithTheErrorOfAVanishedDevice) {
   EXPECT_EQ(GetLastError(), static_cast<DWORD>(ERROR_INVALID_HANDLE));
 }
 
-// Workers read identities while the monitor rebuilds the records: the HID
-// identity is stored, and the driver channel's handle read, under the mutex.
-// The driver's identity bytes 88 77 .. 11 are written as hexadecimal within
-// the length given, never into the record; the HID serial string whatever
-// the length, into the record too.
+// Identities are stored (HID) and handles read (driver) under the mutex; the
+// driver's bytes go out as hexadecimal within the length given, never into
+// the record; the HID serial string, whatever its length, into the record too.
 TEST_F(ButtonEventTest, IdentityReadsWaitForTheStateMutex) {
   ChannelRecord* fireWire = FireWire();
   ChannelRecord* gauge = Gauge();

@@ -98,9 +98,8 @@ TEST_F(PipeServerTest, RequestsAreServedAtTheirDeclaredLengthOrNotAtAll) {
 }
 
 #ifndef _WIN32
-// Six full replies are more than the emulation's 64 KB pipe holds: the server
-// waits for a client that reads late instead of dropping it. (Windows' quota
-// would stop this client's writes first.)
+// Six full replies overfill the emulation's 64 KB pipe: the server waits for a
+// client that reads late. (Windows' quota would block this client's writes.)
 TEST_F(PipeServerTest, RepliesWaitForAClientThatReadsLate) {
   Handle client = Connect();
   ASSERT_TRUE(client);
