@@ -185,15 +185,21 @@ bool ParseDriveKey(const std::string& key, const std::string& value, Block* bloc
       return true;
     }
   }
-  if (key == "peripheral" || key == "additional-length" || key == "sleep-state" ||
-      key == "vendor-code-slot") {
-    if (!ParseNumber(value, &n) || n > 0xFF) return false;
-    if (key == "vendor-code-slot" && n > 3) return false;
-    (key == "peripheral"         ? s.peripheral
-     : key == "sleep-state"      ? s.sleepState
-     : key == "vendor-code-slot" ? s.vendorCodeSlot
-                                 : s.additionalLength) = static_cast<std::uint8_t>(n);
-    return true;
+  struct ByteKey {
+    const char* name;
+    std::uint8_t* field;
+    std::uint64_t max;
+  };
+  const ByteKey byteKeys[] = {{"peripheral", &s.peripheral, 0xFF},
+                              {"additional-length", &s.additionalLength, 0xFF},
+                              {"sleep-state", &s.sleepState, 0xFF},
+                              {"vendor-code-slot", &s.vendorCodeSlot, 3}};
+  for (const auto& k : byteKeys) {
+    if (key == k.name) {
+      if (!ParseNumber(value, &n) || n > k.max) return false;
+      *k.field = static_cast<std::uint8_t>(n);
+      return true;
+    }
   }
   if (key == "last-lba" || key == "block-length" || key == "bus-address" ||
       key == "parent-capabilities" || key == "hid-input-report-length" || key == "disk-number") {
